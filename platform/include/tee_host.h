@@ -1,0 +1,166 @@
+/*
+ * tee_host.h - the host side of the emulated TEE: starting it, loading TAs,
+ * opening sessions into them, and the controls tests use to drive the
+ * platform (clocks, random source, heap failures, trace capture).
+ *
+ * One Tee lives in a process at a time, because TA state is process-wide
+ * as it is on a real TEE. Not for inclusion by TA code.
+ */
+#ifndef TEE_HOST_H
+#define TEE_HOST_H
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "tee_internal_api.h"
+#include "tee_ta_header.h"
+
+namespace tee_host {
+
+struct Config {
+    // Persistent storage and the device identifier live here. Empty: a
+    // fresh temporary directory, removed when the Tee goes.
+    std::filesystem::path state_dir;
+    // What TEE_RPMB_MakeFileSystem reports.
+    bool rpmb_usable = true;
+    // Trace lines at or below this level go to stderr (0: none).
+    int trace_level = TEE_TRACE_ERROR;
+    // Prefix trace lines with the host thread number.
+    bool trace_thread_ids = false;
+    std::string os_manufacturer = "Host TEE Emulation";
+    std::string os_version = "1.0.0";
+};
+
+// A TA living in the host process but written against host C++, such as
+// the stand-ins for the provisioning and fingerprint TAs. Its calls are
+// serialised like those of any TA.
+class NativeTa {
+public:
+    virtual ~NativeTa() = default;
+    virtual TEE_UUID uuid() const = 0;
+    virtual TEE_Result open_session(const TEE_Identity &client, void **ctx) = 0;
+    virtual void close_session(void *ctx) = 0;
+    virtual TEE_Result invoke(void *ctx, uint32_t cmd, uint32_t types, TEE_Param params[4]) = 0;
+};
+
+namespace detail {
+struct Globals;
+}
+
+class Tee {
+public:
+    // Tee - starts the emulated TEE. Aborts if another Tee is alive.
+    explicit Tee(Config config = {});
+    // ~Tee - closes every session (destroying TA instances) and wipes the
+    // platform's secrets.
+    ~Tee();
+    Tee(const Tee &) = delete;
+    Tee &operator=(const Tee &) = delete;
+
+    // install_ta - makes a TA loadable by its UUID. The header outlives the Tee.
+    void install_ta(const ta_header_t *header);
+    void install_native_ta(std::shared_ptr<NativeTa> ta);
+
+    // open_session - opens a session for `client`; creates the TA instance
+    // first when none is alive. On success *session holds a nonzero id.
+    TEE_Result open_session(const TEE_UUID &ta, const TEE_Identity &client, uint32_t param_types,
+                            TEE_Param params[4], uint32_t *session);
+    // invoke - TEE_ERROR_BAD_STATE for an unknown session.
+    TEE_Result invoke(uint32_t session, uint32_t command, uint32_t param_types, TEE_Param params[4]);
+    // close_session - unknown ids are ignored; the last close destroys the instance.
+    void close_session(uint32_t session);
+
+    // instance_alive - whether the TA of that UUID currently has an instance.
+    bool instance_alive(const TEE_UUID &ta) const;
+    size_t open_sessions() const;
+
+    const Config &config() const;
+    // set_rpmb_usable - changes what TEE_RPMB_MakeFileSystem reports from now on.
+    void set_rpmb_usable(bool usable);
+    // boot_seed - the 32 bytes TEE_GetBootSeed gives during this Tee's life.
+    std::vector<uint8_t> boot_seed() const;
+
+    // current - the live Tee, or null.
+    static Tee *current();
+
+    struct Impl;
+    // impl_for_detail - for the platform's own sources only.
+    detail::Globals &impl_for_detail();
+
+private:
+    std::unique_ptr<Impl> impl_;
+};
+
+// An identity for a normal-world client and for a TA client.
+TEE_Identity normal_world_identity();
+TEE_Identity ta_identity(const TEE_UUID &uuid);
+
+// The TA heap: counted against the TA's data size.
+namespace heap {
+struct Allocation {
+    size_t size;
+    std::string file;
+    int line;
+};
+struct Stats {
+    size_t live_count;
+    size_t live_bytes;
+    size_t peak_bytes;
+    uint64_t allocations; // attempts since the Tee started
+    size_t limit;
+};
+Stats stats();
+// live - the allocations not freed yet, oldest first.
+std::vector<Allocation> live();
+// fail_nth - the nth allocation attempt from now (1 = the next) fails;
+// 0 disarms.
+void fail_nth(uint64_t n);
+// injected_failure_fired - whether the armed failure has happened.
+bool injected_failure_fired();
+// leaks_at_last_destroy - what was still live when a TA instance last ended.
+std::vector<Allocation> leaks_at_last_destroy();
+} // namespace heap
+
+// The platform clocks. By default they follow the host's clocks; once
+// frozen they move only when a test advances them.
+namespace clock {
+void freeze();
+void unfreeze();
+void advance_system_ms(uint64_t ms);
+void advance_ree_ms(int64_t ms);
+void advance_ms(uint64_t ms); // both clocks
+void set_ree_ms(uint64_t ms_since_epoch);
+uint64_t system_ms();
+uint64_t ree_ms();
+} // namespace clock
+
+// The random source: scripted bytes are handed out first, in order.
+namespace rng {
+void script(const std::vector<uint8_t> &bytes);
+size_t scripted_left();
+} // namespace rng
+
+// Trace lines as the TA emitted them.
+namespace trace {
+struct Line {
+    int level;
+    std::string func;
+    int line;
+    std::string message;   // the formatted text, without the trailing newline
+    std::string formatted; // the whole line as written, newline included
+};
+void set_level(int level);
+int level();
+// capture - start (true) or stop (false) keeping lines; starting clears.
+void capture(bool on);
+std::vector<Line> captured();
+void clear();
+} // namespace trace
+
+} // namespace tee_host
+
+#endif // TEE_HOST_H

@@ -1,0 +1,241 @@
+/*
+ * heap.cpp - the TA heap: zero-filled allocations counted against the TA's
+ * data size, with failure injection and a record of where each live block
+ * was allocated.
+ */
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <mutex>
+
+#include "platform_internal.h"
+
+namespace tee_host {
+namespace {
+
+struct Block {
+    size_t size;
+    const char *file;
+    int line;
+    uint64_t seq;
+};
+
+struct HeapState {
+    std::mutex mu;
+    std::map<void *, Block> blocks;
+    size_t live_bytes = 0;
+    size_t peak_bytes = 0;
+    size_t limit = 0x80000;
+    uint64_t attempts = 0;
+    uint64_t seq = 0;
+    uint64_t fail_at = 0; // attempt number that fails, 0 = none
+    bool fired = false;
+    std::vector<heap::Allocation> last_leaks;
+};
+
+HeapState &state() {
+    static HeapState s;
+    return s;
+}
+
+// Decides under the lock whether this attempt fails by injection or lack of room.
+bool refuse(HeapState &s, size_t old_size, size_t new_size) {
+    ++s.attempts;
+    if (s.fail_at != 0 && s.attempts == s.fail_at) {
+        s.fail_at = 0;
+        s.fired = true;
+        return true;
+    }
+    return s.live_bytes - old_size + new_size > s.limit;
+}
+
+void *allocate(uint32_t size, uint32_t hint, const char *file, int line) {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    if (refuse(s, 0, size))
+        return nullptr;
+    // One spare byte keeps zero-sized blocks distinct and non-null.
+    void *p = std::malloc(size_t{size} + 1);
+    if (!p)
+        return nullptr;
+    if (hint == TEE_MALLOC_NO_FILL)
+        std::memset(p, 0xA5, size_t{size} + 1); // make reliance on zeroes visible
+    else
+        std::memset(p, 0, size_t{size} + 1);
+    s.blocks[p] = Block{size, file ? file : "?", line, ++s.seq};
+    s.live_bytes += size;
+    if (s.live_bytes > s.peak_bytes)
+        s.peak_bytes = s.live_bytes;
+    return p;
+}
+
+void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
+    if (!buffer)
+        return allocate(new_size, TEE_MALLOC_FILL_ZERO, file, line);
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    auto it = s.blocks.find(buffer);
+    if (it == s.blocks.end())
+        detail::panic("TEE_Realloc of a pointer the heap did not hand out");
+    Block old = it->second;
+    if (refuse(s, old.size, new_size))
+        return nullptr; // the old block stays valid
+    void *p = std::malloc(size_t{new_size} + 1);
+    if (!p)
+        return nullptr;
+    std::memset(p, 0, size_t{new_size} + 1);
+    std::memcpy(p, buffer, old.size < new_size ? old.size : new_size);
+    std::memset(buffer, 0, old.size); // old contents may be secret
+    std::free(buffer);
+    s.blocks.erase(it);
+    s.blocks[p] = Block{new_size, file ? file : old.file, file ? line : old.line, ++s.seq};
+    s.live_bytes = s.live_bytes - old.size + new_size;
+    if (s.live_bytes > s.peak_bytes)
+        s.peak_bytes = s.live_bytes;
+    return p;
+}
+
+std::vector<heap::Allocation> live_locked(HeapState &s) {
+    std::vector<std::pair<uint64_t, heap::Allocation>> v;
+    for (const auto &[p, b] : s.blocks)
+        v.push_back({b.seq, heap::Allocation{b.size, b.file, b.line}});
+    std::sort(v.begin(), v.end(), [](const auto &x, const auto &y) { return x.first < y.first; });
+    std::vector<heap::Allocation> out;
+    for (auto &e : v)
+        out.push_back(std::move(e.second));
+    return out;
+}
+
+} // namespace
+
+namespace heap {
+Stats stats() {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    return Stats{s.blocks.size(), s.live_bytes, s.peak_bytes, s.attempts, s.limit};
+}
+
+std::vector<Allocation> live() {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    return live_locked(s);
+}
+
+void fail_nth(uint64_t n) {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    s.fail_at = n == 0 ? 0 : s.attempts + n;
+    s.fired = false;
+}
+
+bool injected_failure_fired() {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    return s.fired;
+}
+
+std::vector<Allocation> leaks_at_last_destroy() {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    return s.last_leaks;
+}
+} // namespace heap
+
+namespace detail {
+void heap_reset(size_t limit) {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    for (auto &[p, b] : s.blocks) {
+        std::memset(p, 0, b.size);
+        std::free(p);
+    }
+    s.blocks.clear();
+    s.live_bytes = 0;
+    s.peak_bytes = 0;
+    s.limit = limit;
+    s.attempts = 0;
+    s.fail_at = 0;
+    s.fired = false;
+    s.last_leaks.clear();
+}
+
+void heap_instance_ended() {
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    s.last_leaks = live_locked(s);
+    for (const auto &a : s.last_leaks)
+        std::fprintf(stderr, "TA heap leak: %zu bytes allocated at %s:%d\n", a.size, a.file.c_str(), a.line);
+    // A real TEE reclaims the whole instance heap; so do we, after reporting.
+    for (auto &[p, b] : s.blocks) {
+        std::memset(p, 0, b.size);
+        std::free(p);
+    }
+    s.blocks.clear();
+    s.live_bytes = 0;
+}
+} // namespace detail
+} // namespace tee_host
+
+using namespace tee_host;
+
+extern "C" {
+
+void *TEE_MallocAt(uint32_t size, uint32_t hint, const char *file, int line) {
+    return allocate(size, hint, file, line);
+}
+
+void *TEE_ReallocAt(void *buffer, uint32_t newSize, const char *file, int line) {
+    return reallocate(buffer, newSize, file, line);
+}
+
+void *TEE_Malloc(uint32_t size, uint32_t hint) { return allocate(size, hint, nullptr, 0); }
+
+void *TEE_Realloc(void *buffer, uint32_t newSize) { return reallocate(buffer, newSize, nullptr, 0); }
+
+void TEE_Free(void *buffer) {
+    if (!buffer)
+        return;
+    HeapState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    auto it = s.blocks.find(buffer);
+    if (it == s.blocks.end())
+        detail::panic("TEE_Free of a pointer the heap did not hand out");
+    s.live_bytes -= it->second.size;
+    s.blocks.erase(it);
+    std::free(buffer);
+}
+
+void TEE_MemMove(void *dest, const void *src, uint32_t size) {
+    if (size)
+        std::memmove(dest, src, size);
+}
+
+int32_t TEE_MemCompare(const void *buffer1, const void *buffer2, uint32_t size) {
+    if (!size)
+        return 0;
+    int r = std::memcmp(buffer1, buffer2, size);
+    return r < 0 ? -1 : (r > 0 ? 1 : 0);
+}
+
+void TEE_MemFill(void *buffer, uint32_t x, uint32_t size) {
+    if (size)
+        std::memset(buffer, static_cast<int>(x & 0xFF), size);
+}
+
+void TEE_Panic(TEE_Result panicCode) {
+    std::fprintf(stderr, "TEE_Panic: TA panicked with 0x%08x\n", panicCode);
+    std::fflush(stderr);
+    std::abort();
+}
+
+} // extern "C"
+
+namespace tee_host::detail {
+void panic(const char *what) {
+    std::fprintf(stderr, "TEE platform panic: %s\n", what);
+    std::fflush(stderr);
+    std::abort();
+}
+} // namespace tee_host::detail

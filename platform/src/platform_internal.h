@@ -1,0 +1,52 @@
+/*
+ * platform_internal.h - state shared between the platform's source files.
+ */
+#ifndef PLATFORM_INTERNAL_H
+#define PLATFORM_INTERNAL_H
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "tee_host.h"
+
+namespace tee_host::detail {
+
+// The identity of the client whose call the current thread is serving,
+// or null outside entry-point calls.
+const TEE_Identity *current_client();
+
+// The TA whose entry point the current thread is running, or null.
+const ta_header_t *current_ta();
+
+// Heap bookkeeping at instance boundaries.
+void heap_reset(size_t limit);
+void heap_instance_ended(); // records and reclaims what is still live
+
+// Clocks and random source back to their defaults.
+void clock_reset();
+void rng_reset();
+void trace_reset(int level, bool thread_ids);
+
+// Facts of the live Tee; panics when none is alive.
+struct Globals {
+    Config config;
+    TEE_UUID device_id;
+    uint8_t boot_seed[32];
+    bool rpmb_usable;
+};
+Globals &globals();
+
+// Formats and parses the canonical 8-4-4-4-12 text form of a UUID.
+std::string uuid_to_string(const TEE_UUID &u);
+bool uuid_from_string(const std::string &s, TEE_UUID *out);
+
+// Platform panic for API misuse: prints and aborts.
+[[noreturn]] void panic(const char *what);
+
+// Fills buf from OpenSSL's generator (scripted bytes are not used).
+void system_random(void *buf, size_t len);
+
+} // namespace tee_host::detail
+
+#endif

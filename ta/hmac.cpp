@@ -1,0 +1,47 @@
+/*
+ * hmac.cpp - the HMAC provider: capability lists, purpose tables and
+ * parameter getters.
+ */
+#include "algorithm_provider.h"
+
+namespace {
+
+constexpr uint32_t kDigests[] = {KM_DIGEST_MD5,       KM_DIGEST_SHA1,      KM_DIGEST_SHA_2_224,
+                                 KM_DIGEST_SHA_2_256, KM_DIGEST_SHA_2_384, KM_DIGEST_SHA_2_512};
+constexpr uint32_t kImportFormats[] = {KM_KEY_FORMAT_RAW};
+
+
+constexpr purpose_ops_t sign_table() {
+    return purpose_ops_t{list_count_none,   list_write_none,      list_count_none,  list_write_none,
+                         list_count<kDigests>, list_write<kDigests>, nullptr,          param_getter_none,
+                         param_getter_none, param_getter_digest};
+}
+
+const purpose_ops_t hmac_sign_ops = sign_table();
+const purpose_ops_t hmac_verify_ops = sign_table();
+
+const purpose_ops_t *hmac_get_purpose_ops(uint32_t purpose) {
+    switch (purpose) {
+    case KM_PURPOSE_SIGN:
+        return &hmac_sign_ops;
+    case KM_PURPOSE_VERIFY:
+        return &hmac_verify_ops;
+    default:
+        return nullptr;
+    }
+}
+
+} // namespace
+
+const algorithm_provider_t hmac_provider = {
+    KM_ALGORITHM_HMAC,
+    "HMAC",
+    hmac_get_purpose_ops,
+    list_count<kImportFormats>,
+    list_write<kImportFormats>,
+    list_count_none,
+    list_write_none,
+    nullptr,
+    nullptr,
+    export_key_unsupported,
+};

@@ -1,0 +1,157 @@
+/*
+ * ta_fixture.cpp - the test harness around the emulated TEE.
+ */
+#include "ta_fixture.h"
+
+#include <cstdio>
+#include <sstream>
+
+#include "ta_entry.h"
+
+Params Params::value(uint32_t a, uint32_t b) {
+    Params r;
+    r.types = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, 0, 0, 0);
+    r.p[0].value.a = a;
+    r.p[0].value.b = b;
+    return r;
+}
+
+Params Params::io(uint32_t a, uint32_t b, Bytes *in, Bytes *out) {
+    Params r = value(a, b);
+    uint32_t t1 = TEE_PARAM_TYPE_NONE;
+    uint32_t t2 = TEE_PARAM_TYPE_NONE;
+    if (in) {
+        t1 = TEE_PARAM_TYPE_MEMREF_INPUT;
+        r.p[1].memref.buffer = in->data();
+        r.p[1].memref.size = static_cast<uint32_t>(in->size());
+    }
+    if (out) {
+        t2 = TEE_PARAM_TYPE_MEMREF_OUTPUT;
+        r.p[2].memref.buffer = out->data();
+        r.p[2].memref.size = static_cast<uint32_t>(out->size());
+    }
+    r.types = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, t1, t2, 0);
+    return r;
+}
+
+void TaTest::SetUp() {
+    char tmpl[] = "/tmp/km-test-XXXXXX";
+    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    state_dir_ = tmpl;
+    tee_host::Config config;
+    config.state_dir = state_dir_;
+    start(config);
+}
+
+void TaTest::start(tee_host::Config config) {
+    if (config.state_dir.empty())
+        config.state_dir = state_dir_;
+    config.trace_level = 0;
+    tee_ = std::make_unique<tee_host::Tee>(config);
+    tee_->install_ta(&keymaster_ta_header);
+    tee_host::trace::capture(true);
+    session_ = open();
+}
+
+void TaTest::stop() {
+    tee_.reset();
+    session_ = 0;
+}
+
+void TaTest::TearDown() {
+    if (tee_) {
+        tee_->close_session(session_);
+        // Any other sessions a test left open close with the Tee.
+        stop();
+    }
+    EXPECT_EQ(tee_host::heap::stats().live_count, 0u) << "TA heap allocations still live";
+    for (const auto &a : tee_host::heap::leaks_at_last_destroy())
+        ADD_FAILURE() << "leaked " << a.size << " bytes allocated at " << a.file << ":" << a.line;
+    std::error_code ec;
+    std::filesystem::remove_all(state_dir_, ec);
+}
+
+uint32_t TaTest::open(const TEE_UUID *ta_client) {
+    TEE_Identity id = ta_client ? tee_host::ta_identity(*ta_client) : tee_host::normal_world_identity();
+    uint32_t s = 0;
+    TEE_Result res = tee_->open_session(keymaster_ta_uuid, id, 0, nullptr, &s);
+    EXPECT_EQ(res, TEE_SUCCESS);
+    return s;
+}
+
+TEE_Result TaTest::invoke_on(uint32_t session, uint32_t cmd, Params &p) {
+    return tee_->invoke(session, cmd, p.types, p.p);
+}
+
+bool TaTest::logged(int level, std::string_view func, std::string_view message) const {
+    for (const auto &l : tee_host::trace::captured())
+        if (l.level == level && l.func == func && l.message == message)
+            return true;
+    return false;
+}
+
+bool TaTest::logged_message(std::string_view message) const {
+    for (const auto &l : tee_host::trace::captured())
+        if (l.message == message)
+            return true;
+    return false;
+}
+
+std::string TaTest::dump_log() const {
+    std::string s;
+    for (const auto &l : tee_host::trace::captured())
+        s += l.formatted;
+    return s;
+}
+
+int sweep_allocations(const std::function<void()> &setup, const std::function<TEE_Result()> &step,
+                      const std::function<void(int n, TEE_Result res)> &check) {
+    for (int n = 1;; ++n) {
+        if (setup)
+            setup();
+        tee_host::heap::fail_nth(static_cast<uint64_t>(n));
+        TEE_Result res = step();
+        bool fired = tee_host::heap::injected_failure_fired();
+        tee_host::heap::fail_nth(0);
+        if (!fired)
+            return n - 1;
+        check(n, res);
+        if (n > 10000) {
+            ADD_FAILURE() << "allocation sweep does not end";
+            return n;
+        }
+    }
+}
+
+Bytes hex(std::string_view s) {
+    Bytes out;
+    int hi = -1;
+    for (char c : s) {
+        int v = -1;
+        if (c >= '0' && c <= '9')
+            v = c - '0';
+        else if (c >= 'a' && c <= 'f')
+            v = c - 'a' + 10;
+        else if (c >= 'A' && c <= 'F')
+            v = c - 'A' + 10;
+        if (v < 0)
+            continue;
+        if (hi < 0) {
+            hi = v;
+        } else {
+            out.push_back(static_cast<uint8_t>(hi << 4 | v));
+            hi = -1;
+        }
+    }
+    return out;
+}
+
+std::string to_hex(const uint8_t *p, size_t n) {
+    static const char digits[] = "0123456789abcdef";
+    std::string s;
+    for (size_t i = 0; i < n; ++i) {
+        s += digits[p[i] >> 4];
+        s += digits[p[i] & 15];
+    }
+    return s;
+}
