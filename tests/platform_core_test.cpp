@@ -28,6 +28,7 @@ enum ProbeCmd : uint32_t {
     PROBE_PROPERTY_STRING = 2, // memref in: "set\0name", memref out: value
     PROBE_CALL_KEYMASTER = 3,  // value out: a = TEE_Result, b = algorithm count; memref in: command 27 result
     PROBE_SLOW = 4,            // sleeps while counting concurrent callers
+    PROBE_LEAK = 5,            // allocates a block and forgets it
 };
 
 TEE_Result probe_create() {
@@ -89,6 +90,8 @@ TEE_Result probe_invoke(void *, uint32_t cmd, uint32_t, TEE_Param p[4]) {
         --g_inside;
         return TEE_SUCCESS;
     }
+    case PROBE_LEAK:
+        return TEE_MallocAt(24, 0, "/src/ta/leaky.cpp", 77) ? TEE_SUCCESS : TEE_ERROR_OUT_OF_MEMORY;
     default:
         return TEE_ERROR_BAD_PARAMETERS;
     }
@@ -133,6 +136,7 @@ protected:
 // --- Heap --------------------------------------------------------------------
 
 TEST_F(Platform, HeapZeroFillsAndGivesBlocksForZeroBytes) {
+    const auto before = tee_host::heap::stats();
     auto *p = static_cast<uint8_t *>(TEE_Malloc(64, TEE_MALLOC_FILL_ZERO));
     ASSERT_NE(p, nullptr);
     EXPECT_EQ(Bytes(p, p + 64), Bytes(64, 0));
@@ -141,8 +145,8 @@ TEST_F(Platform, HeapZeroFillsAndGivesBlocksForZeroBytes) {
     EXPECT_NE(z1, nullptr);
     EXPECT_NE(z1, z2);
     auto st = tee_host::heap::stats();
-    EXPECT_EQ(st.live_count, 3u);
-    EXPECT_EQ(st.live_bytes, 64u);
+    EXPECT_EQ(st.live_count, before.live_count + 3);
+    EXPECT_EQ(st.live_bytes, before.live_bytes + 64);
     p[0] = 7;
     auto *q = static_cast<uint8_t *>(TEE_Realloc(p, 128));
     ASSERT_NE(q, nullptr);
@@ -152,22 +156,24 @@ TEST_F(Platform, HeapZeroFillsAndGivesBlocksForZeroBytes) {
     TEE_Free(z1);
     TEE_Free(z2);
     TEE_Free(nullptr);
-    EXPECT_EQ(tee_host::heap::stats().live_bytes, 0u);
+    EXPECT_EQ(tee_host::heap::stats().live_bytes, before.live_bytes);
 }
 
 TEST_F(Platform, HeapIsBoundedByTheTaDataSize) {
-    EXPECT_EQ(tee_host::heap::stats().limit, 0x80000u);
-    void *big = TEE_Malloc(0x80000, 0);
+    const auto st = tee_host::heap::stats();
+    EXPECT_EQ(st.limit, 0x80000u);
+    const uint32_t room = static_cast<uint32_t>(st.limit - st.live_bytes);
+    void *big = TEE_Malloc(room, 0);
     ASSERT_NE(big, nullptr);
     EXPECT_EQ(TEE_Malloc(1, 0), nullptr);
     TEE_Free(big);
-    void *half = TEE_Malloc(0x40000, 0);
+    void *half = TEE_Malloc(room / 2, 0);
     ASSERT_NE(half, nullptr);
     // A failed growth keeps the old block.
-    EXPECT_EQ(TEE_Realloc(half, 0x80001), nullptr);
-    EXPECT_EQ(tee_host::heap::stats().live_bytes, 0x40000u);
+    EXPECT_EQ(TEE_Realloc(half, room + 1), nullptr);
+    EXPECT_EQ(tee_host::heap::stats().live_bytes, st.live_bytes + room / 2);
     TEE_Free(half);
-    EXPECT_GE(tee_host::heap::stats().peak_bytes, 0x80000u);
+    EXPECT_EQ(tee_host::heap::stats().peak_bytes, 0x80000u);
 }
 
 TEST_F(Platform, HeapFailsTheNthAllocationOnce) {
@@ -185,19 +191,23 @@ TEST_F(Platform, HeapFailsTheNthAllocationOnce) {
 }
 
 TEST_F(Platform, LeaksAreNamedWhenTheInstanceEnds) {
-    // A block allocated during a command and never freed.
-    void *leak = TEE_MallocAt(24, 0, "/src/ta/leaky.cpp", 77);
-    ASSERT_NE(leak, nullptr);
-    tee_->close_session(session_);
-    session_ = 0;
+    const size_t before = tee_host::heap::stats().live_count;
+    uint32_t s = open_probe(tee_host::normal_world_identity());
+    ASSERT_EQ(tee_->invoke(s, PROBE_LEAK, 0, nullptr), TEE_SUCCESS);
+    EXPECT_EQ(tee_host::heap::stats().live_count, before + 1);
+    tee_->close_session(s);
     auto leaks = tee_host::heap::leaks_at_last_destroy();
     ASSERT_EQ(leaks.size(), 1u);
     EXPECT_EQ(leaks[0].size, 24u);
     EXPECT_EQ(leaks[0].file, "/src/ta/leaky.cpp");
     EXPECT_EQ(leaks[0].line, 77);
-    EXPECT_EQ(tee_host::heap::stats().live_count, 0u); // reclaimed as a real TEE would
-    session_ = open();                                  // a clean instance for teardown
+    // Reclaimed as a real TEE would, and only the ended instance's blocks.
+    EXPECT_EQ(tee_host::heap::stats().live_count, before);
+    EXPECT_TRUE(tee_->instance_alive(keymaster_ta_uuid));
+    // The Keymaster TA's own instance ends clean.
     tee_->close_session(session_);
+    EXPECT_TRUE(tee_host::heap::leaks_at_last_destroy().empty());
+    EXPECT_EQ(tee_host::heap::stats().live_count, 0u);
     session_ = open();
 }
 

@@ -163,4 +163,16 @@ void clear();
 
 } // namespace tee_host
 
+// Object and operation handles the TA holds.
+namespace tee_host::handles {
+// live_objects - transient and persistent object handles not freed or closed yet.
+size_t live_objects();
+// live_operations - operation handles not freed yet.
+size_t live_operations();
+// leaked_at_last_destroy - how many handles (objects and operations) were
+// still live when a TA instance last ended; each was reported on stderr
+// and freed then.
+size_t leaked_at_last_destroy();
+} // namespace tee_host::handles
+
 #endif // TEE_HOST_H

@@ -79,7 +79,8 @@ struct Tee::Impl {
         if (ta.header) {
             CallScope scope(ta, client);
             ta.header->destroy_entry();
-            detail::heap_instance_ended();
+            detail::handles_instance_ended(ta.header);
+            detail::heap_instance_ended(ta.header);
         }
         ta.alive = false;
     }
@@ -215,7 +216,8 @@ TEE_Result Tee::open_session(const TEE_UUID &uuid, const TEE_Identity &client, u
         if (!ta->alive) {
             res = ta->header->create_entry();
             if (res != TEE_SUCCESS) {
-                detail::heap_instance_ended();
+                detail::handles_instance_ended(ta->header);
+                detail::heap_instance_ended(ta->header);
                 return res;
             }
             ta->alive = true;

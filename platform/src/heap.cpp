@@ -16,6 +16,7 @@ namespace tee_host {
 namespace {
 
 struct Block {
+    const void *owner; // the TA whose call allocated it, null outside TA calls
     size_t size;
     const char *file;
     int line;
@@ -64,7 +65,7 @@ void *allocate(uint32_t size, uint32_t hint, const char *file, int line) {
         std::memset(p, 0xA5, size_t{size} + 1); // make reliance on zeroes visible
     else
         std::memset(p, 0, size_t{size} + 1);
-    s.blocks[p] = Block{size, file ? file : "?", line, ++s.seq};
+    s.blocks[p] = Block{detail::current_ta(), size, file ? file : "?", line, ++s.seq};
     s.live_bytes += size;
     if (s.live_bytes > s.peak_bytes)
         s.peak_bytes = s.live_bytes;
@@ -90,7 +91,7 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
     std::memset(buffer, 0, old.size); // old contents may be secret
     std::free(buffer);
     s.blocks.erase(it);
-    s.blocks[p] = Block{new_size, file ? file : old.file, file ? line : old.line, ++s.seq};
+    s.blocks[p] = Block{old.owner, new_size, file ? file : old.file, file ? line : old.line, ++s.seq};
     s.live_bytes = s.live_bytes - old.size + new_size;
     if (s.live_bytes > s.peak_bytes)
         s.peak_bytes = s.live_bytes;
@@ -161,19 +162,30 @@ void heap_reset(size_t limit) {
     s.last_leaks.clear();
 }
 
-void heap_instance_ended() {
+void heap_instance_ended(const void *owner) {
     HeapState &s = state();
     std::lock_guard<std::mutex> lock(s.mu);
-    s.last_leaks = live_locked(s);
-    for (const auto &a : s.last_leaks)
-        std::fprintf(stderr, "TA heap leak: %zu bytes allocated at %s:%d\n", a.size, a.file.c_str(), a.line);
-    // A real TEE reclaims the whole instance heap; so do we, after reporting.
-    for (auto &[p, b] : s.blocks) {
-        std::memset(p, 0, b.size);
-        std::free(p);
+    std::vector<std::pair<uint64_t, heap::Allocation>> leaks;
+    for (auto it = s.blocks.begin(); it != s.blocks.end();) {
+        if (it->second.owner != owner) {
+            ++it;
+            continue;
+        }
+        const Block &b = it->second;
+        leaks.push_back({b.seq, heap::Allocation{b.size, b.file, b.line}});
+        // A real TEE reclaims the whole instance heap; so do we, after reporting.
+        std::memset(it->first, 0, b.size);
+        std::free(it->first);
+        s.live_bytes -= b.size;
+        it = s.blocks.erase(it);
     }
-    s.blocks.clear();
-    s.live_bytes = 0;
+    std::sort(leaks.begin(), leaks.end(), [](const auto &x, const auto &y) { return x.first < y.first; });
+    s.last_leaks.clear();
+    for (auto &l : leaks) {
+        std::fprintf(stderr, "TA heap leak: %zu bytes allocated at %s:%d\n", l.second.size, l.second.file.c_str(),
+                     l.second.line);
+        s.last_leaks.push_back(std::move(l.second));
+    }
 }
 } // namespace detail
 } // namespace tee_host

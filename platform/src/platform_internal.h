@@ -21,7 +21,11 @@ const ta_header_t *current_ta();
 
 // Heap bookkeeping at instance boundaries.
 void heap_reset(size_t limit);
-void heap_instance_ended(); // records and reclaims what is still live
+// heap_instance_ended - records and reclaims what the instance of `owner` still holds.
+void heap_instance_ended(const void *owner);
+// handles_instance_ended - at instance end, reports each object and
+// operation handle still live on stderr, records the count and frees them.
+void handles_instance_ended(const void *owner);
 
 // Clocks and random source back to their defaults.
 void clock_reset();
