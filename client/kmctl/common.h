@@ -1,0 +1,105 @@
+/*
+ * common.h - what every kmctl subcommand shares: global options, exit
+ * codes, opening the TEE, turning statuses into exits, and --in/--out.
+ */
+#ifndef KMCTL_COMMON_H
+#define KMCTL_COMMON_H
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <span>
+#include <stdexcept>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include <CLI/CLI.hpp>
+
+#include "km/client.h"
+#include "km/embedded_tee.h"
+
+namespace kmctl {
+
+enum ExitCode : int {
+    kExitOk = 0,
+    kExitRefused = 1,    // the TA answered with a Keymaster error
+    kExitUsage = 2,      // the command line was wrong
+    kExitTeeFailure = 3, // the TEE failed the command
+    kExitLocal = 4,      // a local file or directory could not be used
+};
+
+// Failure - ends a subcommand: main prints the message on stderr and
+// exits with the code.
+class Failure : public std::runtime_error {
+public:
+    Failure(int code, const std::string &message) : std::runtime_error(message), code_(code) {}
+    int code() const { return code_; }
+
+private:
+    int code_;
+};
+
+struct GlobalOptions {
+    std::string state_dir; // empty: default_state_dir()
+    int trace_level = 1;   // the platform trace threshold, error (1) to flow (4)
+};
+
+// add_global_options - --state and --log-level on the top-level app.
+void add_global_options(CLI::App &app, GlobalOptions &options);
+
+// default_state_dir - $KMCTL_STATE, else $XDG_STATE_HOME/kmctl, else
+// $HOME/.local/state/kmctl. Throws Failure (usage) when none is set.
+std::filesystem::path default_state_dir();
+
+// Session - the embedded TEE started on the state directory, which is
+// created when missing, with a session open and a client on it. Throws
+// Failure: local when the directory cannot be made, TEE failure when the
+// session cannot be opened. One Session per process.
+class Session {
+public:
+    explicit Session(const GlobalOptions &options);
+    km::Client &client() { return client_; }
+
+private:
+    std::unique_ptr<km::EmbeddedTee> tee_;
+    km::Client client_;
+};
+
+// check - returns for an ok status; throws Failure with describe(status)
+// and the refusal or TEE-failure exit code otherwise.
+void check(const km::Status &status);
+
+// take - the value of an ok result; throws as check does.
+template <typename T> T take(km::Result<T> result) {
+    check(result.status);
+    return std::move(result.value);
+}
+
+// add_in_option / add_out_option - --in FILE / --out FILE on a subcommand,
+// defaulting to "-" (stdin / stdout).
+CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what);
+CLI::Option *add_out_option(CLI::App &app, std::string &path, const std::string &what);
+
+// read_input - the whole of a file, or of stdin for "-". Throws Failure
+// (local) when it cannot be read.
+std::vector<uint8_t> read_input(const std::string &path);
+
+// write_output - writes data to stdout for "-"; otherwise to a file,
+// replaced only once the new content is complete. Throws Failure (local).
+void write_output(const std::string &path, std::span<const uint8_t> data);
+void write_output(const std::string &path, std::string_view text);
+
+// Command - a subcommand's CLI11 app and what runs when it is chosen.
+struct Command {
+    CLI::App *app;
+    std::function<void()> run;
+};
+
+// The subcommands, one source file each.
+Command add_info(CLI::App &kmctl, const GlobalOptions &options);
+
+} // namespace kmctl
+
+#endif

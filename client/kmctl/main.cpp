@@ -1,0 +1,50 @@
+/*
+ * main.cpp - kmctl: parses the command line and runs the chosen subcommand.
+ */
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "common.h"
+
+int main(int argc, char **argv) {
+    CLI::App app("Drive the Keymaster TA on the embedded TEE.", "kmctl");
+    kmctl::GlobalOptions options;
+    kmctl::add_global_options(app, options);
+    app.require_subcommand(1);
+    // Global options may also follow the subcommand.
+    app.fallthrough();
+
+    std::vector<kmctl::Command> commands = {
+        kmctl::add_info(app, options),
+    };
+
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError &e) {
+        // A misspelt command would otherwise read "A subcommand is required".
+        std::vector<std::string> rest = app.remaining();
+        if (e.get_name() == "RequiredError" && app.get_subcommands().empty() && !rest.empty()) {
+            std::cerr << "Unknown command: " << rest.front() << "\nRun with --help for more information.\n";
+            return kmctl::kExitUsage;
+        }
+        // --help arrives here too, with exit code 0.
+        return app.exit(e) == 0 ? kmctl::kExitOk : kmctl::kExitUsage;
+    }
+
+    for (const kmctl::Command &c : commands) {
+        if (!c.app->parsed())
+            continue;
+        try {
+            c.run();
+            return kmctl::kExitOk;
+        } catch (const kmctl::Failure &f) {
+            std::cerr << f.what() << '\n';
+            return f.code();
+        } catch (const std::exception &e) {
+            std::cerr << "kmctl: " << e.what() << '\n';
+            return kmctl::kExitLocal;
+        }
+    }
+    return kmctl::kExitUsage;
+}
