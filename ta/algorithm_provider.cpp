@@ -4,6 +4,8 @@
  */
 #include "algorithm_provider.h"
 
+#include "ta_log.h"
+
 const algorithm_provider_t *const algorithm_providers[kAlgorithmProviderCount] = {
     &rsa_provider,
     &aes_provider,
@@ -52,4 +54,16 @@ uint32_t param_getter_block_mode(keymaster_key_param_set_t *in_params, uint32_t 
 TEE_Result export_key_unsupported(const uint8_t *, uint32_t, uint8_t *, uint32_t *, int32_t *error) {
     *error = KM_ERROR_UNSUPPORTED_KEY_FORMAT;
     return TEE_SUCCESS;
+}
+
+TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error, const char *func) {
+    if (key_param_set_has_tag(params, KM_TAG_ORIGIN)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Shouldn't specify KM_TAG_ORIGIN");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return TEE_SUCCESS;
+    }
+    TEE_Result res = key_param_set_add(params, key_param_enum(KM_TAG_ORIGIN, origin));
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+    return res;
 }

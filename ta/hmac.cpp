@@ -1,8 +1,365 @@
 /*
- * hmac.cpp - the HMAC provider: capability lists, purpose tables and
- * parameter getters.
+ * hmac.cpp - the HMAC provider: key generation and import, key data, and
+ * the capability tables.
  */
+#include "hmac.h"
+
 #include "algorithm_provider.h"
+#include "byte_io.h"
+#include "ta_log.h"
+#include "tee_guard.h"
+
+namespace {
+
+struct hmac_digest_t {
+    uint32_t digest;
+    uint32_t key_type;
+    uint32_t min_key_bits;
+    uint32_t max_key_bits;
+    uint32_t max_min_mac_bits;
+    uint32_t algorithm;
+};
+
+constexpr hmac_digest_t kDigestTable[] = {
+    {KM_DIGEST_MD5, TEE_TYPE_HMAC_MD5, 64, 512, 128, TEE_ALG_HMAC_MD5},
+    {KM_DIGEST_SHA1, TEE_TYPE_HMAC_SHA1, 80, 512, 160, TEE_ALG_HMAC_SHA1},
+    {KM_DIGEST_SHA_2_224, TEE_TYPE_HMAC_SHA224, 112, 512, 224, TEE_ALG_HMAC_SHA224},
+    {KM_DIGEST_SHA_2_256, TEE_TYPE_HMAC_SHA256, 192, 1024, 256, TEE_ALG_HMAC_SHA256},
+    {KM_DIGEST_SHA_2_384, TEE_TYPE_HMAC_SHA384, 256, 1024, 384, TEE_ALG_HMAC_SHA384},
+    {KM_DIGEST_SHA_2_512, TEE_TYPE_HMAC_SHA512, 256, 1024, 512, TEE_ALG_HMAC_SHA512},
+};
+
+constexpr uint32_t kKeyDataHeader = 8; // key size and key type words
+
+bool valid_bit_length(uint32_t bits) { return bits >= 64 && bits % 8 == 0; }
+
+// The minimum MAC length and digest rules shared by generation and import;
+// on success *entry is the digest's row.
+TEE_Result check_mac_length_and_digest(const keymaster_key_param_set_t *params, uint32_t key_size,
+                                       const hmac_digest_t **entry, int32_t *error, const char *func) {
+    const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
+    if (!min_mac) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH or specified");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return TEE_SUCCESS;
+    }
+    if (!valid_bit_length(min_mac->integer)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d",
+                    static_cast<int>(min_mac->integer));
+        *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
+        return TEE_SUCCESS;
+    }
+    const key_param_t *digest = key_param_set_find_unique(params, KM_TAG_DIGEST);
+    if (!digest) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
+        *error = KM_ERROR_UNSUPPORTED_DIGEST;
+        return TEE_SUCCESS;
+    }
+    const hmac_digest_t *row = nullptr;
+    for (const hmac_digest_t &r : kDigestTable)
+        if (r.digest == digest->enumerated)
+            row = &r;
+    if (!row) {
+        *error = KM_ERROR_UNSUPPORTED_DIGEST;
+        return TEE_SUCCESS;
+    }
+    if (key_size < row->min_key_bits || key_size > row->max_key_bits) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid HMAC key size %d", static_cast<int>(key_size));
+        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+        return TEE_SUCCESS;
+    }
+    if (min_mac->integer > row->max_min_mac_bits) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d",
+                    static_cast<int>(min_mac->integer));
+        *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
+        return TEE_SUCCESS;
+    }
+    *entry = row;
+    return TEE_SUCCESS;
+}
+
+// Starts key data: allocates header + key_bytes and writes the two header words.
+TEE_Result start_key_data(heap_buf *buf, uint32_t key_size, uint32_t key_type, uint32_t key_bytes,
+                          int32_t oom_error, int32_t *error, const char *func) {
+    if (!buf->alloc(kKeyDataHeader + key_bytes)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        if (oom_error != 0) {
+            *error = oom_error;
+            return TEE_SUCCESS;
+        }
+        return TEE_ERROR_OUT_OF_MEMORY;
+    }
+    byte_writer w(buf->get(), buf->len());
+    if (!w.write_u32(key_size, func) || !w.write_u32(key_type, func))
+        return TEE_ERROR_GENERIC;
+    return TEE_SUCCESS;
+}
+
+// The common exit of both key functions.
+TEE_Result finish_key(TEE_Result res, int32_t *error, bool done, heap_buf *buf, uint8_t **key_data,
+                      uint32_t *key_data_len) {
+    if (done && res == TEE_SUCCESS && *error == KM_ERROR_OK) {
+        *key_data_len = buf->len();
+        *key_data = buf->release();
+        return TEE_SUCCESS;
+    }
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    return res;
+}
+
+} // namespace
+
+uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
+    for (const hmac_digest_t &r : kDigestTable)
+        if (r.key_type == key_type)
+            return r.algorithm;
+    return 0;
+}
+
+TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                             int32_t *error) {
+    heap_buf buf(true);
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    *key_data = nullptr;
+    *key_data_len = 0;
+    *error = KM_ERROR_OK;
+
+    do {
+        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (!size) {
+            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const uint32_t key_size = size->integer;
+        if (!valid_bit_length(key_size)) {
+            KM_ERR("Invalid hmac key size %d", static_cast<int>(key_size));
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        const hmac_digest_t *row = nullptr;
+        res = check_mac_length_and_digest(params, key_size, &row, error, __func__);
+        if (res != TEE_SUCCESS || *error)
+            break;
+
+        object_guard obj;
+        res = TEE_AllocateTransientObject(row->key_type, key_size, obj.out());
+        if (res != TEE_SUCCESS) {
+            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+            break;
+        }
+        res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("GenerateKey failed with 0x%08x\n", res);
+            break;
+        }
+        const uint32_t key_bytes = key_size / 8;
+        res = start_key_data(&buf, key_size, row->key_type, key_bytes, 0, error, __func__);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        uint32_t got = key_bytes;
+        res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, buf.get() + kKeyDataHeader, &got);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
+            break;
+        }
+        if (got != key_bytes) {
+            KM_ERR("Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes), static_cast<int>(got));
+            *error = KM_ERROR_UNKNOWN_ERROR;
+            break;
+        }
+        done = true;
+    } while (false);
+    return finish_key(res, error, done, &buf, key_data, key_data_len);
+}
+
+TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
+    heap_buf buf(true);
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    *key_data = nullptr;
+    *key_data_len = 0;
+    *error = KM_ERROR_OK;
+
+    do {
+        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
+            KM_ERR("Invalid hmac key size %d", -1);
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        const uint32_t guessed = material_len * 8;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (size) {
+            if (size->integer != guessed) {
+                KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
+                       static_cast<int>(guessed));
+                *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+                break;
+            }
+        } else {
+            res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
+            if (res != TEE_SUCCESS) {
+                KM_ERR("Out of memory");
+                break;
+            }
+        }
+        if (!valid_bit_length(guessed)) {
+            KM_ERR("Invalid hmac key size %d", static_cast<int>(guessed));
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        const hmac_digest_t *row = nullptr;
+        res = check_mac_length_and_digest(params, guessed, &row, error, __func__);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        res = start_key_data(&buf, guessed, row->key_type, material_len, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
+                             __func__);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        TEE_MemMove(buf.get() + kKeyDataHeader, material, material_len);
+        done = true;
+    } while (false);
+    return finish_key(res, error, done, &buf, key_data, key_data_len);
+}
+
+TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
+                                 uint32_t *key_size, uint32_t *key_type, int32_t *error) {
+    *object = nullptr;
+    if (key_size)
+        *key_size = 0;
+    byte_reader r(key_data, key_data_len);
+    uint32_t bits = 0;
+    uint32_t type = 0;
+    const uint8_t *key = nullptr;
+    if (!r.read_u32(&bits) || !r.read_u32(&type) || !r.read_bytes(bits / 8, &key))
+        return TEE_ERROR_GENERIC;
+    TEE_Attribute attr{};
+    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
+    object_guard obj;
+    TEE_Result res = TEE_AllocateTransientObject(type, bits, obj.out());
+    if (res != TEE_SUCCESS) {
+        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
+    if (res != TEE_SUCCESS) {
+        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    *object = obj.release();
+    *key_type = type;
+    if (key_size)
+        *key_size = bits;
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                                   keymaster_key_param_set_t *out_params, int32_t *error,
+                                   const hmac_operation_fns_t *fns, const char *func) {
+    auto *op = static_cast<hmac_operation_t *>(ta_malloc(sizeof(hmac_operation_t)));
+    if (!op) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        key_param_set_release(out_params);
+        return nullptr;
+    }
+    op->header.free = fns->free;
+    op->header.update = fns->update;
+    op->header.finish = fns->finish;
+    bool ok = [&] {
+        uint32_t key_type = 0;
+        TEE_Result res = hmac_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, &key_type, error);
+        if (res != TEE_SUCCESS || *error) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+            return false;
+        }
+        const key_param_t *mac_length = key_param_set_find_unique(in_params, KM_TAG_MAC_LENGTH);
+        if (!mac_length) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MAC_LENGTH");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            return false;
+        }
+        op->mac_length = mac_length->integer;
+        const uint32_t algorithm = hmac_algorithm_for_key_type(key_type);
+        if (!algorithm) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported key type");
+            *error = KM_ERROR_INVALID_KEY_BLOB;
+            return false;
+        }
+        res = TEE_AllocateOperation(&op->operation, algorithm, TEE_MODE_MAC, op->key_size);
+        if (res != TEE_SUCCESS) {
+            op->operation = nullptr;
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
+            return false;
+        }
+        res = TEE_SetOperationKey(op->operation, op->key);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "SetOperationKey failed with 0x%08x\n", res);
+            return false;
+        }
+        TEE_MACInit(op->operation, nullptr, 0);
+        return true;
+    }();
+    if (ok)
+        return &op->header;
+    key_param_set_release(out_params);
+    if (op->key)
+        TEE_FreeTransientObject(op->key);
+    if (op->operation)
+        TEE_FreeOperation(op->operation);
+    ta_free(op);
+    return nullptr;
+}
+
+TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
+                                 int32_t *error) {
+    TEE_MACUpdate(reinterpret_cast<hmac_operation_t *>(op)->operation, input, *input_len);
+    *output_len = 0;
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_len, int32_t *error,
+                              const char *func) {
+    *mac_len = 64;
+    TEE_Result res = TEE_MACComputeFinal(op->operation, nullptr, 0, mac, mac_len);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "MACComputeFinal failed with 0x%08x\n", res);
+        return res;
+    }
+    if (op->mac_length / 8 > *mac_len) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Too short output of HMAC operation, expect at least %dB, got %dB",
+                    static_cast<int>(op->mac_length / 8), static_cast<int>(*mac_len));
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    }
+    return TEE_SUCCESS;
+}
+
+void hmac_operation_free(operation_t *op, const char *record_name, const char *func) {
+    if (!op) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free NULL %s", record_name);
+        return;
+    }
+    auto *h = reinterpret_cast<hmac_operation_t *>(op);
+    if (h->key)
+        TEE_FreeTransientObject(h->key);
+    else
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
+    if (h->operation)
+        TEE_FreeOperation(h->operation);
+    else
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
+    ta_free(h);
+}
 
 namespace {
 
@@ -10,15 +367,19 @@ constexpr uint32_t kDigests[] = {KM_DIGEST_MD5,       KM_DIGEST_SHA1,      KM_DI
                                  KM_DIGEST_SHA_2_256, KM_DIGEST_SHA_2_384, KM_DIGEST_SHA_2_512};
 constexpr uint32_t kImportFormats[] = {KM_KEY_FORMAT_RAW};
 
-
 constexpr purpose_ops_t sign_table() {
-    return purpose_ops_t{list_count_none,   list_write_none,      list_count_none,  list_write_none,
-                         list_count<kDigests>, list_write<kDigests>, nullptr,          param_getter_none,
-                         param_getter_none, param_getter_digest};
+    return purpose_ops_t{list_count_none,      list_write_none,      list_count_none, list_write_none,
+                         list_count<kDigests>, list_write<kDigests>, nullptr,         param_getter_none,
+                         param_getter_none,    param_getter_digest};
 }
 
-const purpose_ops_t hmac_sign_ops = sign_table();
-const purpose_ops_t hmac_verify_ops = sign_table();
+constexpr purpose_ops_t with_create(purpose_ops_t t, decltype(purpose_ops_t::create_operation) create) {
+    t.create_operation = create;
+    return t;
+}
+
+const purpose_ops_t hmac_sign_ops = with_create(sign_table(), create_hmac_sign);
+const purpose_ops_t hmac_verify_ops = with_create(sign_table(), create_hmac_verify);
 
 const purpose_ops_t *hmac_get_purpose_ops(uint32_t purpose) {
     switch (purpose) {
@@ -34,14 +395,7 @@ const purpose_ops_t *hmac_get_purpose_ops(uint32_t purpose) {
 } // namespace
 
 const algorithm_provider_t hmac_provider = {
-    KM_ALGORITHM_HMAC,
-    "HMAC",
-    hmac_get_purpose_ops,
-    list_count<kImportFormats>,
-    list_write<kImportFormats>,
-    list_count_none,
-    list_write_none,
-    nullptr,
-    nullptr,
-    export_key_unsupported,
+    KM_ALGORITHM_HMAC,          "HMAC",          hmac_get_purpose_ops, list_count<kImportFormats>,
+    list_write<kImportFormats>, list_count_none, list_write_none,      hmac_generate_key,
+    hmac_import_key,            export_key_unsupported,
 };

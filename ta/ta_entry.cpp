@@ -5,6 +5,10 @@
 #include "ta_entry.h"
 
 #include "capability_query.h"
+#include "key_management.h"
+#include "key_store.h"
+#include "auth_token.h"
+#include "operation_pool.h"
 #include "keymaster_defs.h"
 #include "ta_heap.h"
 #include "ta_log.h"
@@ -66,6 +70,37 @@ template <TEE_Result (*F)(uint32_t, uint8_t *, uint32_t, int32_t *)> TEE_Result 
     return F(algorithm, static_cast<uint8_t *>(p[2].memref.buffer), p[2].memref.size, error_slot(p));
 }
 
+uint8_t *in_buf(TEE_Param p[4]) { return static_cast<uint8_t *>(p[1].memref.buffer); }
+uint8_t *out_buf(TEE_Param p[4]) { return static_cast<uint8_t *>(p[2].memref.buffer); }
+
+// Commands 13, 15, 19, 20: (request, response and its size, error).
+template <TEE_Result (*F)(const uint8_t *, uint32_t, uint8_t *, uint32_t *, int32_t *)>
+TEE_Result on_request_response(void *, TEE_Param p[4]) {
+    return F(in_buf(p), p[1].memref.size, out_buf(p), &p[2].memref.size, error_slot(p));
+}
+TEE_Result on_character_size(void *, TEE_Param p[4]) {
+    return get_key_character_size(in_buf(p), p[1].memref.size, error_slot(p), &p[0].value.b);
+}
+TEE_Result on_delete_key(void *, TEE_Param p[4]) { return delete_key(in_buf(p), p[1].memref.size, error_slot(p)); }
+TEE_Result on_delete_all_key(void *, TEE_Param p[4]) { return delete_all_key(error_slot(p)); }
+TEE_Result on_open_key(void *, TEE_Param p[4]) {
+    return open_key_raw(static_cast<uint8_t *>(p[0].memref.buffer), &p[0].memref.size);
+}
+
+// Commands 16, 17: (a, request, response and its size, error, b).
+TEE_Result on_begin(void *, TEE_Param p[4]) {
+    return begin(p[0].value.a, in_buf(p), p[1].memref.size, out_buf(p), &p[2].memref.size, error_slot(p),
+                 &p[0].value.b);
+}
+TEE_Result on_update(void *, TEE_Param p[4]) {
+    return update(p[0].value.a, in_buf(p), p[1].memref.size, out_buf(p), &p[2].memref.size, error_slot(p),
+                  &p[0].value.b);
+}
+TEE_Result on_finish(void *, TEE_Param p[4]) {
+    return finish(p[0].value.a, in_buf(p), p[1].memref.size, out_buf(p), &p[2].memref.size, error_slot(p));
+}
+TEE_Result on_abort(void *, TEE_Param p[4]) { return _abort(p[0].value.a, error_slot(p)); }
+
 constexpr uint32_t types(uint32_t t0, uint32_t t1, uint32_t t2) { return TEE_PARAM_TYPES(t0, t1, t2, kParamsNone); }
 constexpr uint32_t kTypesValue = types(kValueInout, kParamsNone, kParamsNone);                              // 0x0003
 constexpr uint32_t kTypesValueOut = types(kValueInout, kParamsNone, TEE_PARAM_TYPE_MEMREF_OUTPUT);          // 0x0603
@@ -99,18 +134,18 @@ const command_t kCommands[] = {
      on_format_count<get_support_export_format_cnt>},
     {KM_CMD_GET_SUPPORT_EXPORT_FORMAT, "get_support_export_format", kTypesValueOut, CHECK_B, false,
      on_format_list<get_support_export_format>},
-    {KM_CMD_GENERATE_KEY, "generate_key", kTypesInOut, CHECK_AB, false, nullptr},
-    {KM_CMD_GET_KEY_CHARACTER_SIZE, "get_key_character_size", kTypesIn, CHECK_AB, false, nullptr},
-    {KM_CMD_GET_KEY_CHARACTER, "get_key_character", kTypesInOut, CHECK_AB, false, nullptr},
-    {KM_CMD_BEGIN, "begin", kTypesInOut, CHECK_B, false, nullptr},
-    {KM_CMD_UPDATE, "update", kTypesInOut, CHECK_B, false, nullptr},
-    {KM_CMD_FINISH, "finish", kTypesInOut, CHECK_B, false, nullptr},
-    {KM_CMD_IMPORT_KEY, "import_key", kTypesInOut, CHECK_AB, false, nullptr},
-    {KM_CMD_EXPORT_KEY, "export_key", kTypesInOut, CHECK_AB, false, nullptr},
-    {KM_CMD_DELETE_KEY, "delete_key", kTypesIn, CHECK_AB, false, nullptr},
-    {KM_CMD_DELETE_ALL_KEY, "delete_all_key", kTypesValue, CHECK_AB, false, nullptr},
-    {KM_CMD_ABORT, "_abort", kTypesValue, CHECK_B, false, nullptr},
-    {KM_CMD_OPEN_KEY, "open_key", kTypesMemInout, CHECK_NONE, true, nullptr},
+    {KM_CMD_GENERATE_KEY, "generate_key", kTypesInOut, CHECK_AB, false, on_request_response<generate_key>},
+    {KM_CMD_GET_KEY_CHARACTER_SIZE, "get_key_character_size", kTypesIn, CHECK_AB, false, on_character_size},
+    {KM_CMD_GET_KEY_CHARACTER, "get_key_character", kTypesInOut, CHECK_AB, false, on_request_response<get_key_character>},
+    {KM_CMD_BEGIN, "begin", kTypesInOut, CHECK_B, false, on_begin},
+    {KM_CMD_UPDATE, "update", kTypesInOut, CHECK_B, false, on_update},
+    {KM_CMD_FINISH, "finish", kTypesInOut, CHECK_B, false, on_finish},
+    {KM_CMD_IMPORT_KEY, "import_key", kTypesInOut, CHECK_AB, false, on_request_response<import_key>},
+    {KM_CMD_EXPORT_KEY, "export_key", kTypesInOut, CHECK_AB, false, on_request_response<export_key>},
+    {KM_CMD_DELETE_KEY, "delete_key", kTypesIn, CHECK_AB, false, on_delete_key},
+    {KM_CMD_DELETE_ALL_KEY, "delete_all_key", kTypesValue, CHECK_AB, false, on_delete_all_key},
+    {KM_CMD_ABORT, "_abort", kTypesValue, CHECK_B, false, on_abort},
+    {KM_CMD_OPEN_KEY, "open_key", kTypesMemInout, CHECK_NONE, true, on_open_key},
     {KM_CMD_SOTER_GENERATE_ATTK_KEY_PAIR, "soter_handle_generate_attk_key_pair", kTypesValue, CHECK_B, false,
      nullptr},
     {KM_CMD_SOTER_VERIFY_ATTK_KEY_PAIR, "soter_handle_verify_attk_key_pair", kTypesValue, CHECK_AB, false, nullptr},
@@ -149,9 +184,33 @@ const ta_property_t kTaProperties[] = {
 
 extern "C" {
 
-TEE_Result TA_CreateEntryPoint(void) { return TEE_SUCCESS; }
+TEE_Result TA_CreateEntryPoint(void) {
+    TEE_Result res = key_store_init();
+    if (res != TEE_SUCCESS) {
+        KM_ERR("Init key store failed");
+        return res;
+    }
+    res = operation_pool_init();
+    if (res != TEE_SUCCESS) {
+        KM_ERR("Init operation pool failed");
+        key_store_deinit();
+        return res;
+    }
+    res = authorizaiton_init();
+    if (res != TEE_SUCCESS) {
+        KM_ERR("Init authorization failed");
+        key_store_deinit();
+        return res;
+    }
+    return TEE_SUCCESS;
+}
 
-void TA_DestroyEntryPoint(void) {}
+void TA_DestroyEntryPoint(void) {
+    // Operations belong to no session; they end with the instance.
+    operation_pool_end_all();
+    authorization_deinit();
+    key_store_deinit();
+}
 
 TEE_Result TA_OpenSessionEntryPoint(uint32_t, TEE_Param[4], void **sessionContext) {
     TEE_Identity identity{};

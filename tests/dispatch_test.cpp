@@ -174,7 +174,7 @@ TEST_F(Dispatch, CommandsWithoutAHandlerFailVisiblyAndCleanly) {
             EXPECT_TRUE(said) << std::hex << shape.id;
         }
     }
-    EXPECT_EQ(tee_host::heap::stats().live_count, 0u);
+    EXPECT_EQ(extra_allocations(), 0u);
 }
 
 TEST_F(Dispatch, OpenKeyIsDeniedToUntrustedSessionsEvenWithWrongTypes) {
@@ -197,7 +197,7 @@ TEST_F(Dispatch, TrustedTaSessionsPassTheAccessCheck) {
     for (const TEE_UUID &trusted : trusted_client_uuids) {
         uint32_t s = open(&trusted);
         // The context is a 16-byte copy of the client UUID.
-        EXPECT_EQ(tee_host::heap::stats().live_count, 1u);
+        EXPECT_EQ(extra_allocations(), 1u);
         tee_host::trace::clear();
         Params p;
         p.types = 0x0003;
@@ -207,7 +207,7 @@ TEST_F(Dispatch, TrustedTaSessionsPassTheAccessCheck) {
         auto line = tee_host::trace::captured().front();
         EXPECT_EQ(line.message.find("pSessionContext (nil)"), std::string::npos) << line.message;
         tee_->close_session(s);
-        EXPECT_EQ(tee_host::heap::stats().live_count, 0u);
+        EXPECT_EQ(extra_allocations(), 0u);
     }
 }
 

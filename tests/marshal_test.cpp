@@ -137,7 +137,7 @@ TEST_F(Marshal, EveryTruncationIsRefusedAndLeavesTheSetEmpty) {
         EXPECT_TRUE(logged(TEE_TRACE_ERROR, "unmarshal", "Too short input")) << n;
         EXPECT_EQ(back.params, nullptr);
         EXPECT_EQ(back.length, 0u);
-        EXPECT_EQ(tee_host::heap::stats().live_count, 0u) << n;
+        EXPECT_EQ(extra_allocations(), 0u) << n;
     }
 }
 
@@ -242,7 +242,7 @@ TEST_F(Marshal, MarshalAllocationFailure) {
                                        EXPECT_TRUE(logged_message("Out of memory, need 55B"));
                                    });
     EXPECT_EQ(points, 1);
-    EXPECT_EQ(tee_host::heap::stats().live_count, 2u); // the set's own array and data
+    EXPECT_EQ(extra_allocations(), 2u); // the set's own array and data
 }
 
 TEST_F(Marshal, UnmarshalAllocationFailures) {
@@ -263,7 +263,7 @@ TEST_F(Marshal, UnmarshalAllocationFailures) {
         },
         [&](int n, TEE_Result res) {
             EXPECT_EQ(res, TEE_ERROR_OUT_OF_MEMORY) << n;
-            EXPECT_EQ(tee_host::heap::stats().live_count, 0u) << n;
+            EXPECT_EQ(extra_allocations(), 0u) << n;
             const char *expected = n == 1 ? "Out of memory" : (n == 2 ? "Out of memory, require 2B" : "Out of memory, require 1B");
             EXPECT_TRUE(logged(TEE_TRACE_ERROR, "unmarshal", expected)) << n << "\n" << dump_log();
         });

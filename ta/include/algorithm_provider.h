@@ -101,6 +101,14 @@ uint32_t param_getter_digest(keymaster_key_param_set_t *in_params, uint32_t *val
 uint32_t param_getter_padding(keymaster_key_param_set_t *in_params, uint32_t *value);
 uint32_t param_getter_block_mode(keymaster_key_param_set_t *in_params, uint32_t *value);
 
+/*
+ * provider_set_origin - refuses a caller-supplied KM_TAG_ORIGIN (*error -38)
+ * and appends KM_TAG_ORIGIN = origin. TEE_ERROR_OUT_OF_MEMORY when the set
+ * cannot grow. Logs in the calling provider's name.
+ */
+TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error,
+                               const char *func = __builtin_FUNCTION());
+
 /* export_key_unsupported - the export slot of providers without an export format. */
 TEE_Result export_key_unsupported(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
                                   int32_t *error);

@@ -51,6 +51,7 @@ void TaTest::start(tee_host::Config config) {
     tee_->install_ta(&keymaster_ta_header);
     tee_host::trace::capture(true);
     session_ = open();
+    baseline_live_ = tee_host::heap::stats().live_count;
 }
 
 void TaTest::stop() {
@@ -65,6 +66,9 @@ void TaTest::TearDown() {
         stop();
     }
     EXPECT_EQ(tee_host::heap::stats().live_count, 0u) << "TA heap allocations still live";
+    EXPECT_EQ(tee_host::handles::live_objects(), 0u) << "TEE objects still open";
+    EXPECT_EQ(tee_host::handles::live_operations(), 0u) << "TEE operations still allocated";
+    EXPECT_EQ(tee_host::handles::leaked_at_last_destroy(), 0u) << "TEE handles left to the instance teardown";
     for (const auto &a : tee_host::heap::leaks_at_last_destroy())
         ADD_FAILURE() << "leaked " << a.size << " bytes allocated at " << a.file << ":" << a.line;
     std::error_code ec;

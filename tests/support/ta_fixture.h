@@ -48,7 +48,12 @@ protected:
     bool logged_message(std::string_view message) const;
     std::string dump_log() const;
 
+    // extra_allocations - live TA heap blocks beyond what the TA instance
+    // itself holds between commands (its use log and token cache).
+    size_t extra_allocations() const { return tee_host::heap::stats().live_count - baseline_live_; }
+
     std::unique_ptr<tee_host::Tee> tee_;
+    size_t baseline_live_ = 0;
     std::filesystem::path state_dir_;
     uint32_t session_ = 0;
 };

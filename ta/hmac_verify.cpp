@@ -1,0 +1,54 @@
+/*
+ * hmac_verify.cpp - HMAC verification: the caller's signature against the
+ * leftmost bytes of the MAC of all input.
+ */
+#include "hmac.h"
+#include "ta_log.h"
+
+namespace {
+
+TEE_Result hmac_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input,
+                              uint32_t *input_len, uint8_t *, uint32_t *output_len, int32_t *error) {
+    return hmac_operation_update(op, input, input_len, output_len, error);
+}
+
+// A signature of any other length than the MAC length is a mismatch; the
+// comparison never reads past either buffer and takes the same time for
+// any content.
+TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, const uint8_t *signature,
+                              uint32_t signature_len, uint8_t **output, uint32_t *output_len,
+                              keymaster_key_param_set_t *, int32_t *error) {
+    auto *h = reinterpret_cast<hmac_verify_operation_t *>(op);
+    uint8_t mac[64] = {};
+    uint32_t mac_len = 0;
+    *output = nullptr;
+    *output_len = 0;
+    TEE_Result res = hmac_operation_mac(h, mac, &mac_len, error, __func__);
+    if (res != TEE_SUCCESS || *error)
+        return res;
+    const uint32_t want = h->mac_length / 8;
+    uint8_t diff = signature_len == want ? 0 : 1;
+    for (uint32_t i = 0; i < want && i < signature_len; ++i)
+        diff |= static_cast<uint8_t>(mac[i] ^ signature[i]);
+    TEE_MemFill(mac, 0, sizeof mac);
+    if (diff != 0) {
+        KM_ERR("Signature mismatch");
+        *error = KM_ERROR_VERIFICATION_FAILED;
+        return TEE_SUCCESS;
+    }
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+void hmac_verify_free(operation_t *op) { hmac_operation_free(op, "hmac_verify_operation_t", __func__); }
+
+const hmac_operation_fns_t kVerifyFns = {hmac_verify_free, hmac_verify_update, hmac_verify_finish,
+                                         "hmac_verify_operation_t"};
+
+} // namespace
+
+operation_t *create_hmac_verify(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *,
+                                keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
+                                int32_t *error) {
+    return hmac_operation_create(key_data, key_data_len, in_params, out_params, error, &kVerifyFns, __func__);
+}

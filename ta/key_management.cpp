@@ -1,0 +1,279 @@
+/*
+ * key_management.cpp - generating, importing, describing, exporting and
+ * deleting keys. Keys live only in the blobs handed to the caller.
+ */
+#include "key_management.h"
+
+#include "algorithm_provider.h"
+#include "authorization.h"
+#include "byte_io.h"
+#include "key_store.h"
+#include "marshal.h"
+#include "soter.h"
+#include "ta_log.h"
+
+namespace {
+
+// A failure that set neither a result nor an error is still a failure.
+void settle(TEE_Result res, bool done, int32_t *error) {
+    if (!done && res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        *error = KM_ERROR_UNKNOWN_ERROR;
+}
+
+bool blob_usage_repeated(const keymaster_key_param_set_t *params, const char *func = __builtin_FUNCTION()) {
+    if (key_param_set_at_most_one(params, KM_TAG_BLOB_USAGE_REQUIREMENTS))
+        return false;
+    KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Too many KM_TAG_BLOB_USAGE_REQUIREMENTS specified");
+    return true;
+}
+
+// An opened key: its data and full parameter set, released together.
+struct opened_key {
+    heap_buf data{true};
+    keymaster_key_param_set_t params{};
+    param_set_guard params_guard{&params};
+};
+
+// Reads a key reference, opens the blob and checks the application binding.
+TEE_Result open_key_reference(const uint8_t *in, uint32_t in_len, bool check_blob_size, opened_key *key,
+                              int32_t *error, const char *func) {
+    byte_reader r(in, in_len);
+    const uint8_t *blob = nullptr;
+    const uint8_t *app_id = nullptr;
+    const uint8_t *app_data = nullptr;
+    uint32_t blob_len = 0;
+    uint32_t app_id_len = 0;
+    uint32_t app_data_len = 0;
+    if (!r.read_lv(&blob, &blob_len, func) || !r.read_lv(&app_id, &app_id_len, func) ||
+        !r.read_lv(&app_data, &app_data_len, func))
+        return TEE_ERROR_GENERIC;
+    if (check_blob_size && blob_len <= 1) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Wrong key_blob_size %d", static_cast<int>(blob_len));
+        *error = KM_ERROR_INVALID_KEY_BLOB;
+        return TEE_SUCCESS;
+    }
+    uint8_t *data = nullptr;
+    uint32_t data_len = 0;
+    TEE_Result res = open_key(blob, blob_len, &data, &data_len, &key->params, error);
+    if (res != TEE_SUCCESS || *error != KM_ERROR_OK) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Open key failed");
+        return res;
+    }
+    key->data.adopt(data, data_len);
+    if (check_app_id_and_app_data(&key->params, app_id, app_id_len, app_data, app_data_len) != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Wrong AppId or AppData");
+        *error = KM_ERROR_INVALID_KEY_BLOB;
+    }
+    return TEE_SUCCESS;
+}
+
+} // namespace
+
+TEE_Result generate_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    keymaster_key_param_set_t params{};
+    param_set_guard params_guard(&params);
+    heap_buf key_data(true);
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    *error = KM_ERROR_OK;
+
+    do {
+        if (unmarshal(in, in_len, &params) != TEE_SUCCESS) {
+            KM_ERR("Unmarshal failed");
+            res = TEE_ERROR_BAD_PARAMETERS;
+            break;
+        }
+        KM_DUMP_PARAM_SET(&params);
+        const key_param_t *alg = key_param_set_find_unique(&params, KM_TAG_ALGORITHM);
+        if (!alg) {
+            KM_ERR("No KM_TAG_ALGORITHM or many KM_TAG_ALGORITHM");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
+        if (!provider || !provider->generate_key) {
+            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
+            break;
+        }
+        uint8_t *data = nullptr;
+        uint32_t data_len = 0;
+        res = provider->generate_key(&params, &data, &data_len, error);
+        key_data.adopt(data, data_len);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        if (blob_usage_repeated(&params)) {
+            *error = KM_ERROR_INVALID_TAG;
+            break;
+        }
+        res = save_key(key_data.get(), key_data.len(), &params, out, out_len);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("Can't save key to TEE storage");
+            break;
+        }
+        done = true;
+    } while (false);
+    if (!done) {
+        TEE_MemFill(out, 0, *out_len);
+        *out_len = 0;
+    }
+    settle(res, done, error);
+    return res;
+}
+
+TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    keymaster_key_param_set_t params{};
+    param_set_guard params_guard(&params);
+    heap_buf key_data(true);
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    const uint32_t capacity = *out_len;
+    *error = KM_ERROR_OK;
+
+    do {
+        byte_reader r(in, in_len);
+        const uint8_t *ser = nullptr;
+        uint32_t ser_len = 0;
+        if (!r.read_lv(&ser, &ser_len)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        if (unmarshal(ser, ser_len, &params) != TEE_SUCCESS) {
+            KM_ERR("Unmarshal failed");
+            res = TEE_ERROR_BAD_PARAMETERS;
+            break;
+        }
+        KM_DUMP_PARAM_SET(&params);
+        const key_param_t *alg = key_param_set_find_unique(&params, KM_TAG_ALGORITHM);
+        if (!alg) {
+            KM_ERR("No or too many KM_TAG_ALGORITHM");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
+        if (!provider || !provider->import_key) {
+            KM_ERR("Unsupport import_key for algorithm %s (%d)", provider ? provider->name : "",
+                   static_cast<int>(alg->enumerated));
+            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
+            break;
+        }
+        uint8_t *data = nullptr;
+        uint32_t data_len = 0;
+        res = provider->import_key(&params, r.pos(), r.remaining(), &data, &data_len, error);
+        key_data.adopt(data, data_len);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        if (blob_usage_repeated(&params)) {
+            *error = KM_ERROR_INVALID_TAG;
+            break;
+        }
+
+        byte_writer w(out, capacity);
+        uint8_t *blob_len_at = nullptr;
+        if (!w.reserve(4, &blob_len_at)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        uint32_t blob_len = w.remaining();
+        res = save_key(key_data.get(), key_data.len(), &params, w.pos(), &blob_len);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("Can't save key to TEE storage");
+            break;
+        }
+        put_u32le(blob_len_at, blob_len);
+        uint8_t *blob_at = nullptr;
+        uint8_t *chars_len_at = nullptr;
+        if (!w.reserve(blob_len, &blob_at) || !w.reserve(4, &chars_len_at)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        uint8_t *chars = w.pos();
+        uint32_t chars_len = w.remaining();
+        res = marshal(&params, false, &chars, &chars_len);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("Marshal failed");
+            break;
+        }
+        put_u32le(chars_len_at, chars_len);
+        *out_len = 8 + blob_len + chars_len;
+        done = true;
+    } while (false);
+    if (!done)
+        TEE_MemFill(out, 0, capacity);
+    settle(res, done, error);
+    return res;
+}
+
+TEE_Result get_key_character_size(const uint8_t *in, uint32_t in_len, int32_t *error, uint32_t *size) {
+    opened_key key;
+    *size = 0;
+    *error = KM_ERROR_OK;
+    TEE_Result res = open_key_reference(in, in_len, true, &key, error, __func__);
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        *size = marshal_size(&key.params, false);
+    return res;
+}
+
+TEE_Result get_key_character(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    opened_key key;
+    *error = KM_ERROR_OK;
+    TEE_Result res = open_key_reference(in, in_len, true, &key, error, __func__);
+    if (res != TEE_SUCCESS || *error != KM_ERROR_OK)
+        return res;
+    res = marshal(&key.params, false, &out, out_len);
+    if (res != TEE_SUCCESS)
+        KM_ERR("Marshal failed");
+    return res;
+}
+
+TEE_Result export_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    opened_key key;
+    bool done = false;
+    *error = KM_ERROR_OK;
+    TEE_Result res = open_key_reference(in, in_len, false, &key, error, __func__);
+    if (res != TEE_SUCCESS || *error != KM_ERROR_OK)
+        return res;
+
+    if (key_param_set_has_tag(&key.params, KM_TAG_SOTER_IS_FROM_SOTER)) {
+        KM_DEBUG("soter export_key\n");
+        return soter_enhance_export_key(&key.params, key.data.get(), key.data.len(), out, out_len, error);
+    }
+    KM_DEBUG("normal export_key\n");
+    do {
+        const key_param_t *alg = key_param_set_find_unique(&key.params, KM_TAG_ALGORITHM);
+        if (!alg) {
+            KM_ERR("No or too many KM_TAG_ALGORITHM");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
+        if (!provider || !provider->export_key) {
+            KM_ERR("Unsupported algorithm");
+            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
+            break;
+        }
+        res = provider->export_key(key.data.get(), key.data.len(), out, out_len, error);
+        if (res != TEE_SUCCESS || *error) {
+            KM_ERR("Export key failed");
+            break;
+        }
+        done = true;
+    } while (false);
+    settle(res, done, error);
+    return res;
+}
+
+TEE_Result delete_key(const uint8_t *in, uint32_t in_len, int32_t *error) {
+    *error = KM_ERROR_OK;
+    TEE_Result res = key_store_delete_key(in, in_len, error);
+    if (res != TEE_SUCCESS || *error != KM_ERROR_OK)
+        KM_ERR("Keystore delete key failed");
+    return res;
+}
+
+TEE_Result delete_all_key(int32_t *error) {
+    *error = KM_ERROR_OK;
+    TEE_Result res = key_store_delete_all_keys();
+    if (res != TEE_SUCCESS)
+        KM_ERR("Keystore delete key failed");
+    return res;
+}
