@@ -3,6 +3,11 @@
  */
 #include "key_commands.h"
 
+#include <algorithm>
+
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+
 #include "keymaster_defs.h"
 #include "ta_entry.h"
 
@@ -97,6 +102,103 @@ TEE_Result KeyTest::open_raw(uint32_t session, const Bytes &blob, Bytes *payload
     TEE_Result res = invoke_on(session, KM_CMD_OPEN_KEY, p);
     payload->resize(res == TEE_SUCCESS ? p.p[0].memref.size : 0);
     return res;
+}
+
+Outcome KeyTest::begin(uint32_t purpose, const Bytes &blob, const km::ParamSet &params, uint32_t *handle,
+                       Bytes *out_params) {
+    Bytes in;
+    km::put_lv(in, blob);
+    km::put_lv(in, params.serialize());
+    Bytes out(1024, 0xEE);
+    Params p = Params::io(purpose, 0, &in, &out);
+    TEE_Result res = invoke(KM_CMD_BEGIN, p);
+    *handle = p.p[0].value.b;
+    if (out_params)
+        out_params->assign(out.begin(), out.begin() + p.p[2].memref.size);
+    return outcome(res, p);
+}
+
+Outcome KeyTest::update(uint32_t handle, const Bytes &data, const km::ParamSet &params, Bytes *output,
+                        uint32_t *consumed) {
+    Bytes in;
+    km::put_lv(in, data);
+    km::put_lv(in, params.serialize());
+    Bytes out(data.size() + 64, 0xEE);
+    Params p = Params::io(handle, 0, &in, &out);
+    TEE_Result res = invoke(KM_CMD_UPDATE, p);
+    if (consumed)
+        *consumed = p.p[0].value.b;
+    if (output)
+        output->assign(out.begin(), out.begin() + p.p[2].memref.size);
+    return outcome(res, p);
+}
+
+Outcome KeyTest::finish(uint32_t handle, const Bytes &signature, const km::ParamSet &params, Bytes *output,
+                        size_t capacity) {
+    Bytes in;
+    km::put_lv(in, signature);
+    km::put_lv(in, params.serialize());
+    Bytes out(capacity, 0xEE);
+    Params p = Params::io(handle, 0, &in, &out);
+    TEE_Result res = invoke(KM_CMD_FINISH, p);
+    Outcome o = outcome(res, p);
+    if (output) {
+        output->clear();
+        if (o.ok()) {
+            uint32_t n = km::get_u32(out.data());
+            EXPECT_EQ(p.p[2].memref.size, 8 + n + km::get_u32(out.data() + 4 + n));
+            output->assign(out.begin() + 4, out.begin() + 4 + n);
+        }
+    }
+    return o;
+}
+
+Outcome KeyTest::abort(uint32_t handle) {
+    Params p = Params::value(handle, 0);
+    return outcome(invoke(KM_CMD_ABORT, p), p);
+}
+
+Outcome KeyTest::run(uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params, const Bytes &message,
+                     size_t chunk, const Bytes &signature, Bytes *out) {
+    uint32_t handle = 0;
+    Outcome o = begin(purpose, blob, begin_params, &handle);
+    if (!o.ok())
+        return o;
+    for (size_t off = 0; off < message.size(); off += chunk) {
+        Bytes piece(message.begin() + static_cast<long>(off),
+                    message.begin() + static_cast<long>(std::min(message.size(), off + chunk)));
+        uint32_t consumed = 0;
+        o = update(handle, piece, {}, nullptr, &consumed);
+        if (!o.ok())
+            return o;
+        EXPECT_EQ(consumed, piece.size());
+    }
+    return finish(handle, signature, {}, out);
+}
+
+void KeyTest::restart_instance() {
+    tee_->close_session(session_);
+    session_ = open();
+    baseline_live_ = tee_host::heap::stats().live_count;
+}
+
+Bytes KeyTest::mint_token(uint64_t challenge, uint64_t user_id, uint64_t authenticator_id, uint32_t auth_type,
+                          uint64_t timestamp_ms, uint8_t version) {
+    Bytes t(69, 0);
+    t[0] = version;
+    for (int i = 0; i < 8; ++i) {
+        t[1 + i] = static_cast<uint8_t>(challenge >> (8 * i));
+        t[9 + i] = static_cast<uint8_t>(user_id >> (8 * i));
+        t[17 + i] = static_cast<uint8_t>(authenticator_id >> (8 * i));
+        t[29 + i] = static_cast<uint8_t>(timestamp_ms >> (8 * (7 - i)));
+    }
+    for (int i = 0; i < 4; ++i)
+        t[25 + i] = static_cast<uint8_t>(auth_type >> (8 * (3 - i)));
+    Bytes seed = tee_->boot_seed();
+    unsigned int len = 0;
+    HMAC(EVP_sha256(), seed.data(), static_cast<int>(seed.size()), t.data(), 37, t.data() + 37, &len);
+    EXPECT_EQ(len, 32u);
+    return t;
 }
 
 km::ParamSet KeyTest::hmac_params(uint32_t key_bits, uint32_t digest, uint32_t min_mac) {

@@ -32,6 +32,26 @@ protected:
     // open_raw - command 27 on a session; *payload receives what came back.
     TEE_Result open_raw(uint32_t session, const Bytes &blob, Bytes *payload);
 
+    // begin - command 16; *handle is b on return, *out_params the serialized output parameters.
+    Outcome begin(uint32_t purpose, const Bytes &blob, const km::ParamSet &params, uint32_t *handle,
+                  Bytes *out_params = nullptr);
+    // update - command 17; *consumed is b on return.
+    Outcome update(uint32_t handle, const Bytes &data, const km::ParamSet &params = {}, Bytes *output = nullptr,
+                   uint32_t *consumed = nullptr);
+    // finish - command 18; *output the operation's output, *out_params its parameters.
+    Outcome finish(uint32_t handle, const Bytes &signature = {}, const km::ParamSet &params = {},
+                   Bytes *output = nullptr, size_t capacity = 4096);
+    Outcome abort(uint32_t handle);
+    // sign_all - begin, one update per chunk, finish; the MAC or signature in *out.
+    Outcome run(uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params, const Bytes &message,
+                size_t chunk, const Bytes &signature, Bytes *out);
+
+    // restart_instance - a fresh TA instance on the same Tee (new anchors, empty use log and token cache).
+    void restart_instance();
+    // mint_token - a 69-byte auth token MACed with the platform's boot seed.
+    Bytes mint_token(uint64_t challenge, uint64_t user_id, uint64_t authenticator_id, uint32_t auth_type,
+                     uint64_t timestamp_ms, uint8_t version = 0);
+
     // A 256-bit HMAC-SHA-256 key with a 128-bit minimum MAC length.
     static km::ParamSet hmac_params(uint32_t key_bits = 256, uint32_t digest = 4, uint32_t min_mac = 128);
 };
