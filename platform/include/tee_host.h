@@ -49,6 +49,10 @@ public:
 
 namespace detail {
 struct Globals;
+// rsa_cache_clear - frees (and so wipes) every prepared RSA key the
+// platform holds and zeroes the cache's counters; the Tee calls it as it
+// shuts down.
+void rsa_cache_clear();
 }
 
 class Tee {
@@ -143,6 +147,18 @@ namespace rng {
 void script(const std::vector<uint8_t> &bytes);
 size_t scripted_left();
 } // namespace rng
+
+// Prepared RSA keys: the platform keeps the last few keys it prepared for
+// operations (in its own memory, never the TA's), so that a key populated
+// again with the same components skips OpenSSL's per-key set-up.
+namespace rsa_cache {
+struct Stats {
+    uint64_t hits;   // preparations served from the cache since the Tee started
+    uint64_t misses; // keys prepared anew
+    size_t size;     // keys held now
+};
+Stats stats();
+} // namespace rsa_cache
 
 // Trace lines as the TA emitted them.
 namespace trace {

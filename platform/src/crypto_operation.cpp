@@ -10,6 +10,7 @@
 #include <unordered_map>
 
 #include "operation_internal.h"
+#include "rsa_internal.h"
 
 namespace tee_host::detail {
 namespace {
@@ -44,6 +45,8 @@ TEE_Result setup_by_class(Operation &op) {
         // byte (0x30 RSA, 0x41 ECDSA, 0x42 ECDH); their engines derive
         // from AsymmetricEngine. TEE_MODE_EXPORT arrives with an RSA
         // algorithm's class.
+        if ((op.info.algorithm & 0xFF) == 0x30)
+            return rsa_setup(op);
         return TEE_ERROR_NOT_SUPPORTED;
     default:
         return TEE_ERROR_NOT_SUPPORTED;

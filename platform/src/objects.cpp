@@ -13,6 +13,7 @@
 #include <unordered_map>
 
 #include "object_internal.h"
+#include "rsa_internal.h"
 
 namespace tee_host {
 namespace detail {
@@ -150,7 +151,7 @@ const ObjectTypeOps *secret_object_type(uint32_t type) {
 
 const ObjectTypeOps *find_object_type(uint32_t type) {
     // Each key family's lookup; RSA and EC add theirs here.
-    for (auto lookup : {secret_object_type})
+    for (auto lookup : {secret_object_type, rsa_object_type})
         if (const ObjectTypeOps *ops = lookup(type))
             return ops;
     return nullptr;
@@ -331,6 +332,7 @@ void TEE_ResetTransientObject(TEE_ObjectHandle object) {
 TEE_Result TEE_PopulateTransientObject(TEE_ObjectHandle object, const TEE_Attribute *attrs, uint32_t attrCount) {
     Object &obj = transient_uninitialized(object, __func__);
     AttributeMap map = collect_attributes(*obj.ops, attrs, attrCount);
+    rsa_minimal_integers(obj.type, map);
     uint32_t bits = 0;
     TEE_Result res = obj.ops->key_bits(map, &bits);
     if (res != TEE_SUCCESS)
