@@ -67,3 +67,25 @@ TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origi
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
     return res;
 }
+
+operation_t *operation_record_alloc(uint32_t size, const operation_fns_t *fns) {
+    auto *op = static_cast<operation_t *>(ta_malloc(size));
+    if (!op)
+        return nullptr;
+    op->free = fns->free;
+    op->update = fns->update;
+    op->finish = fns->finish;
+    return op;
+}
+
+TEE_Result provider_settle_key(TEE_Result res, bool done, int32_t *error, heap_buf *buf, uint8_t **key_data,
+                               uint32_t *key_data_len) {
+    if (done && res == TEE_SUCCESS && *error == KM_ERROR_OK) {
+        *key_data_len = buf->len();
+        *key_data = buf->release();
+        return TEE_SUCCESS;
+    }
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    return res;
+}

@@ -95,19 +95,6 @@ TEE_Result start_key_data(heap_buf *buf, uint32_t key_size, uint32_t key_type, u
     return TEE_SUCCESS;
 }
 
-// The common exit of both key functions.
-TEE_Result finish_key(TEE_Result res, int32_t *error, bool done, heap_buf *buf, uint8_t **key_data,
-                      uint32_t *key_data_len) {
-    if (done && res == TEE_SUCCESS && *error == KM_ERROR_OK) {
-        *key_data_len = buf->len();
-        *key_data = buf->release();
-        return TEE_SUCCESS;
-    }
-    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
-        *error = KM_ERROR_UNKNOWN_ERROR;
-    return res;
-}
-
 } // namespace
 
 uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
@@ -175,7 +162,7 @@ TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_da
         }
         done = true;
     } while (false);
-    return finish_key(res, error, done, &buf, key_data, key_data_len);
+    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
 }
 
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
@@ -228,7 +215,7 @@ TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *mat
         TEE_MemMove(buf.get() + kKeyDataHeader, material, material_len);
         done = true;
     } while (false);
-    return finish_key(res, error, done, &buf, key_data, key_data_len);
+    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
 }
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
@@ -265,16 +252,13 @@ TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len,
 
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                    keymaster_key_param_set_t *out_params, int32_t *error,
-                                   const hmac_operation_fns_t *fns, const char *func) {
-    auto *op = static_cast<hmac_operation_t *>(ta_malloc(sizeof(hmac_operation_t)));
+                                   const operation_fns_t *fns, const char *func) {
+    auto *op = reinterpret_cast<hmac_operation_t *>(operation_record_alloc(sizeof(hmac_operation_t), fns));
     if (!op) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
         key_param_set_release(out_params);
         return nullptr;
     }
-    op->header.free = fns->free;
-    op->header.update = fns->update;
-    op->header.finish = fns->finish;
     bool ok = [&] {
         uint32_t key_type = 0;
         TEE_Result res = hmac_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, &key_type, error);

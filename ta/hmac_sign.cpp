@@ -39,7 +39,7 @@ TEE_Result hmac_sign_finish(operation_t *op, keymaster_key_param_set_t *, const 
 
 void hmac_sign_free(operation_t *op) { hmac_operation_free(op, "hmac_sign_operation_t", __func__); }
 
-const hmac_operation_fns_t kSignFns = {hmac_sign_free, hmac_sign_update, hmac_sign_finish, "hmac_sign_operation_t"};
+const operation_fns_t kSignFns = {hmac_sign_free, hmac_sign_update, hmac_sign_finish, "hmac_sign_operation_t"};
 
 } // namespace
 

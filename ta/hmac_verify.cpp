@@ -42,7 +42,7 @@ TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, cons
 
 void hmac_verify_free(operation_t *op) { hmac_operation_free(op, "hmac_verify_operation_t", __func__); }
 
-const hmac_operation_fns_t kVerifyFns = {hmac_verify_free, hmac_verify_update, hmac_verify_finish,
+const operation_fns_t kVerifyFns = {hmac_verify_free, hmac_verify_update, hmac_verify_finish,
                                          "hmac_verify_operation_t"};
 
 } // namespace

@@ -162,7 +162,7 @@ TEE_Result key_store_init_rpmb_ksk() {
         KM_ERR("Wrong persistent data length, expected %dB, got %dB", static_cast<int>(kKskSize),
                static_cast<int>(count));
         KM_ERR("Now, delete the key and recreate it, but all previous keymaster key will die");
-        pobj.close();
+        pobj.reset();
         res = TEE_OpenPersistentObject(TEE_STORAGE_PRIVATE_RPMB, kKskObjectId, sizeof kKskObjectId,
                                        TEE_DATA_FLAG_ACCESS_WRITE_META, pobj.out());
         if (res != TEE_SUCCESS) {

@@ -16,23 +16,6 @@ namespace {
 
 using km::ParamSet;
 
-const EVP_MD *md_for(uint32_t digest) {
-    switch (digest) {
-    case KM_DIGEST_MD5:
-        return EVP_md5();
-    case KM_DIGEST_SHA1:
-        return EVP_sha1();
-    case KM_DIGEST_SHA_2_224:
-        return EVP_sha224();
-    case KM_DIGEST_SHA_2_256:
-        return EVP_sha256();
-    case KM_DIGEST_SHA_2_384:
-        return EVP_sha384();
-    default:
-        return EVP_sha512();
-    }
-}
-
 Bytes openssl_hmac(uint32_t digest, const Bytes &key, const Bytes &msg) {
     Bytes out(EVP_MAX_MD_SIZE);
     unsigned int len = 0;

@@ -28,6 +28,20 @@ struct operation_t {
                          keymaster_key_param_set_t *out_params, int32_t *error);
 };
 
+/*
+ * operation_fns_t - the functions a provider's operation records carry,
+ * and the record name their log lines use.
+ */
+struct operation_fns_t {
+    void (*free)(operation_t *op);
+    decltype(operation_t::update) update;
+    decltype(operation_t::finish) finish;
+    const char *record_name;
+};
+
+/* operation_record_alloc - a zero-filled record of size bytes with its functions set; null when out of memory. */
+operation_t *operation_record_alloc(uint32_t size, const operation_fns_t *fns);
+
 struct purpose_ops_t {
     uint32_t (*block_mode_count)();
     void (*get_block_modes)(uint32_t *out);
@@ -108,6 +122,14 @@ uint32_t param_getter_block_mode(keymaster_key_param_set_t *in_params, uint32_t 
  */
 TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error,
                                const char *func = __builtin_FUNCTION());
+
+/*
+ * provider_settle_key - the common exit of the key functions: on success
+ * hands *buf over as the key data; otherwise a failure that set neither a
+ * result nor an error becomes KM_ERROR_UNKNOWN_ERROR.
+ */
+TEE_Result provider_settle_key(TEE_Result res, bool done, int32_t *error, heap_buf *buf, uint8_t **key_data,
+                               uint32_t *key_data_len);
 
 /* export_key_unsupported - the export slot of providers without an export format. */
 TEE_Result export_key_unsupported(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,

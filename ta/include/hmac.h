@@ -38,20 +38,11 @@ struct hmac_operation_t {
 using hmac_sign_operation_t = hmac_operation_t;
 using hmac_verify_operation_t = hmac_operation_t;
 
-/* The functions a sign or verify record carries, and the name its logs use. */
-struct hmac_operation_fns_t {
-    void (*free)(operation_t *op);
-    TEE_Result (*update)(operation_t *, keymaster_key_param_set_t *, const uint8_t *, uint32_t *, uint8_t *,
-                         uint32_t *, int32_t *);
-    TEE_Result (*finish)(operation_t *, keymaster_key_param_set_t *, const uint8_t *, uint32_t, uint8_t **,
-                         uint32_t *, keymaster_key_param_set_t *, int32_t *);
-    const char *record_name;
-};
 
 /* hmac_operation_create - builds a keyed MAC operation record; null with *error on failure. */
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                    keymaster_key_param_set_t *out_params, int32_t *error,
-                                   const hmac_operation_fns_t *fns, const char *func);
+                                   const operation_fns_t *fns, const char *func);
 /* hmac_operation_update - feeds the whole input to the MAC. */
 TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
                                  int32_t *error);

@@ -11,6 +11,25 @@
 #include "keymaster_defs.h"
 #include "ta_entry.h"
 
+const EVP_MD *md_for(uint32_t digest) {
+    switch (digest) {
+    case KM_DIGEST_MD5:
+        return EVP_md5();
+    case KM_DIGEST_SHA1:
+        return EVP_sha1();
+    case KM_DIGEST_SHA_2_224:
+        return EVP_sha224();
+    case KM_DIGEST_SHA_2_256:
+        return EVP_sha256();
+    case KM_DIGEST_SHA_2_384:
+        return EVP_sha384();
+    case KM_DIGEST_SHA_2_512:
+        return EVP_sha512();
+    default:
+        return nullptr;
+    }
+}
+
 Bytes key_reference(const Bytes &blob, const Bytes &app_id, const Bytes &app_data) {
     Bytes out;
     km::put_lv(out, blob);

@@ -8,6 +8,10 @@
 #include "km/param_set.h"
 #include "ta_fixture.h"
 
+struct evp_md_st;
+// md_for - OpenSSL's digest for a Keymaster digest (MD5 to SHA-512), null otherwise.
+const evp_md_st *md_for(uint32_t digest);
+
 struct Outcome {
     TEE_Result res;
     int32_t error;
