@@ -16,6 +16,11 @@
 #include <vector>
 
 #include <gtest/gtest.h>
+#include <openssl/bio.h>
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
 
 extern char **environ;
 
@@ -235,8 +240,9 @@ protected:
     }
 
     // run - kmctl with args, its environment changed by env (an empty
-    // value removes the variable).
-    CliRun run(const std::vector<std::string> &args, const std::map<std::string, std::string> &env = {}) {
+    // value removes the variable), its stdin read from stdin_file.
+    CliRun run(const std::vector<std::string> &args, const std::map<std::string, std::string> &env = {},
+               const fs::path &stdin_file = "/dev/null") {
         fs::path out_file = dir_ / "stdout";
         fs::path err_file = dir_ / "stderr";
         std::vector<std::string> argv_s = {KMCTL_PATH};
@@ -262,7 +268,7 @@ protected:
 
         pid_t pid = fork();
         if (pid == 0) {
-            int in = open("/dev/null", O_RDONLY);
+            int in = open(stdin_file.c_str(), O_RDONLY);
             int out = open(out_file.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
             int err = open(err_file.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
             if (in < 0 || out < 0 || err < 0 || dup2(in, 0) < 0 || dup2(out, 1) < 0 || dup2(err, 2) < 0)
@@ -545,6 +551,450 @@ TEST_F(Kmctl, UnusableStateDirectory) {
     EXPECT_EQ(blocked.status, 4);
     EXPECT_NE(blocked.err.find((file / "state").string()), std::string::npos) << blocked.err;
     EXPECT_EQ(blocked.out, "");
+}
+
+// ---- keys and operations ----
+
+using Bytes = std::vector<uint8_t>;
+
+// The characteristics table: tag name -> values as printed.
+std::map<std::string, std::string> parse_characteristics(const std::string &text) {
+    std::map<std::string, std::string> out;
+    std::istringstream in(text);
+    std::string line;
+    while (std::getline(in, line)) {
+        size_t gap = line.find("  ");
+        if (gap == std::string::npos) {
+            ADD_FAILURE() << "line without a value: " << line;
+            continue;
+        }
+        EXPECT_FALSE(out.count(line.substr(0, gap))) << "tag printed twice: " << line;
+        out[line.substr(0, gap)] = line.substr(line.find_first_not_of(' ', gap));
+    }
+    return out;
+}
+
+Bytes hmac_sha256(const Bytes &key, const Bytes &data) {
+    unsigned char mac[EVP_MAX_MD_SIZE] = {};
+    unsigned int n = 0;
+    HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), data.data(), data.size(), mac, &n);
+    return Bytes(mac, mac + n);
+}
+
+class KmctlKeys : public Kmctl {
+protected:
+    // km - kmctl on this test's state directory.
+    CliRun km(std::vector<std::string> args, const fs::path &stdin_file = "/dev/null") {
+        args.insert(args.begin(), {"--state", state_.string()});
+        return run(args, {}, stdin_file);
+    }
+    std::string path(const std::string &name) const { return (dir_ / name).string(); }
+    void put(const std::string &name, const Bytes &data) {
+        std::ofstream out(dir_ / name, std::ios::binary);
+        out.write(reinterpret_cast<const char *>(data.data()), static_cast<std::streamsize>(data.size()));
+    }
+    Bytes get(const std::string &name) {
+        std::string s = slurp(dir_ / name);
+        return Bytes(s.begin(), s.end());
+    }
+    // A 256-bit HMAC-SHA-256 key made by kmctl generate, plus extra options.
+    void generate_hmac(const std::string &blob, std::vector<std::string> extra = {}) {
+        std::vector<std::string> args = {"generate", "--algorithm",      "hmac", "--size", "256",     "--digest",
+                                         "sha256",   "--min-mac-length", "128",  "--out",  path(blob)};
+        args.insert(args.end(), extra.begin(), extra.end());
+        CliRun r = km(args);
+        ASSERT_EQ(r.status, 0) << r.err;
+        ASSERT_EQ(r.out, "");
+    }
+
+    static Bytes pattern(size_t n) {
+        Bytes b(n);
+        for (size_t i = 0; i < n; ++i)
+            b[i] = static_cast<uint8_t>((i * 31 + i / 251) & 0xFF);
+        return b;
+    }
+};
+
+const std::string kVerificationFailed = "KM_ERROR_VERIFICATION_FAILED (-30): The signature or MAC does not verify.";
+const std::string kInvalidKeyBlob = "KM_ERROR_INVALID_KEY_BLOB (-33): The key blob is not valid.";
+
+TEST_F(KmctlKeys, GeneratedKeyDescribesItselfInTextAndJson) {
+    generate_hmac("k.blob", {"--tag", "ACTIVE_DATETIME=2026-01-31T12:00:00Z", "--tag", "max-uses-per-boot=9"});
+    EXPECT_GT(get("k.blob").size(), 0u);
+
+    CliRun text = km({"characteristics", "--key", path("k.blob")});
+    ASSERT_EQ(text.status, 0) << text.err;
+    const std::map<std::string, std::string> expected = {
+        {"KM_TAG_ALGORITHM", "hmac"},
+        {"KM_TAG_KEY_SIZE", "256"},
+        {"KM_TAG_PURPOSE", "sign, verify"}, // the algorithm's purposes by default
+        {"KM_TAG_DIGEST", "sha_2_256"},
+        {"KM_TAG_MIN_MAC_LENGTH", "128"},
+        {"KM_TAG_ACTIVE_DATETIME", "2026-01-31T12:00:00Z"},
+        {"KM_TAG_MAX_USES_PER_BOOT", "9"},
+        {"KM_TAG_NO_AUTH_REQUIRED", "true"}, // added so that the key is usable
+        {"KM_TAG_ORIGIN", "generated"},
+    };
+    EXPECT_EQ(parse_characteristics(text.out), expected) << text.out;
+
+    CliRun json = km({"characteristics", "--key", path("k.blob"), "--json"});
+    ASSERT_EQ(json.status, 0) << json.err;
+    std::optional<Json> doc = JsonReader(json.out).parse();
+    ASSERT_TRUE(doc && doc->kind == Json::Object) << json.out;
+    EXPECT_EQ(doc->members.size(), expected.size());
+    for (const auto &[name, value] : doc->members)
+        EXPECT_TRUE(expected.count(name)) << name << " is not in the text form";
+    ASSERT_TRUE(doc->get("KM_TAG_KEY_SIZE") && doc->get("KM_TAG_PURPOSE") && doc->get("KM_TAG_NO_AUTH_REQUIRED"));
+    EXPECT_EQ(doc->get("KM_TAG_ALGORITHM")->text, "hmac");
+    EXPECT_EQ(doc->get("KM_TAG_KEY_SIZE")->kind, Json::Number);
+    EXPECT_EQ(doc->get("KM_TAG_KEY_SIZE")->number, 256);
+    EXPECT_EQ(doc->get("KM_TAG_PURPOSE")->strings(), (std::vector<std::string>{"sign", "verify"}));
+    EXPECT_EQ(doc->get("KM_TAG_DIGEST")->strings(), std::vector<std::string>{"sha_2_256"}) << "repeatable: an array";
+    EXPECT_EQ(doc->get("KM_TAG_NO_AUTH_REQUIRED")->kind, Json::Bool);
+    EXPECT_TRUE(doc->get("KM_TAG_NO_AUTH_REQUIRED")->flag);
+    EXPECT_EQ(doc->get("KM_TAG_ACTIVE_DATETIME")->text, "2026-01-31T12:00:00Z");
+    EXPECT_EQ(doc->get("KM_TAG_ORIGIN")->text, "generated");
+}
+
+TEST_F(KmctlKeys, ByteStringsShowTheirLengthOnly) {
+    // "secret!" as a parameter the TA keeps visible.
+    generate_hmac("k.blob", {"--tag", "ASSOCIATED_DATA=73656372657421"});
+    CliRun text = km({"characteristics", "--key", path("k.blob")});
+    ASSERT_EQ(text.status, 0) << text.err;
+    EXPECT_EQ(parse_characteristics(text.out)["KM_TAG_ASSOCIATED_DATA"], "7 bytes");
+    CliRun json = km({"characteristics", "--key", path("k.blob"), "--json"});
+    ASSERT_EQ(json.status, 0) << json.err;
+    std::optional<Json> doc = JsonReader(json.out).parse();
+    ASSERT_TRUE(doc && doc->get("KM_TAG_ASSOCIATED_DATA"));
+    const Json *length = doc->get("KM_TAG_ASSOCIATED_DATA")->get("length");
+    ASSERT_TRUE(length);
+    EXPECT_EQ(length->number, 7);
+    for (const std::string &out : {text.out, json.out}) {
+        EXPECT_EQ(out.find("secret"), std::string::npos) << out;
+        EXPECT_EQ(out.find("7365637265"), std::string::npos) << out;
+    }
+}
+
+TEST_F(KmctlKeys, NoAuthRequiredIsAddedOnlyWhenAuthIsNotConfigured) {
+    generate_hmac("given.blob", {"--tag", "NO_AUTH_REQUIRED"});
+    CliRun given = km({"characteristics", "--key", path("given.blob")});
+    ASSERT_EQ(given.status, 0) << given.err;
+    EXPECT_EQ(parse_characteristics(given.out)["KM_TAG_NO_AUTH_REQUIRED"], "true");
+
+    generate_hmac("user.blob", {"--tag", "USER_SECURE_ID=5", "--tag", "USER_SECURE_ID=6", "--tag", "AUTH_TIMEOUT=60"});
+    CliRun user = km({"characteristics", "--key", path("user.blob")});
+    ASSERT_EQ(user.status, 0) << user.err;
+    auto chars = parse_characteristics(user.out);
+    EXPECT_EQ(chars.count("KM_TAG_NO_AUTH_REQUIRED"), 0u) << user.out;
+    EXPECT_EQ(chars["KM_TAG_USER_SECURE_ID"], "5, 6");
+}
+
+TEST_F(KmctlKeys, MacOfAMultiChunkFileMatchesOpenSsl) {
+    const Bytes secret = pattern(32);
+    put("raw.key", secret);
+    CliRun imported = km({"import", "--algorithm", "hmac", "--digest", "sha256", "--min-mac-length", "128", "--in",
+                          path("raw.key"), "--out", path("k.blob")});
+    ASSERT_EQ(imported.status, 0) << imported.err;
+    CliRun chars = km({"characteristics", "--key", path("k.blob")});
+    EXPECT_EQ(parse_characteristics(chars.out)["KM_TAG_ORIGIN"], "imported");
+    EXPECT_EQ(parse_characteristics(chars.out)["KM_TAG_KEY_SIZE"], "256");
+
+    // Three 64 KiB pieces and a ragged end.
+    const Bytes message = pattern(3 * 65536 + 1017);
+    put("msg", message);
+    CliRun sign = km({"sign", "--key", path("k.blob"), "--in", path("msg"), "--out", path("mac")});
+    ASSERT_EQ(sign.status, 0) << sign.err;
+    EXPECT_EQ(sign.out, "");
+    EXPECT_EQ(get("mac"), hmac_sha256(secret, message)) << "the whole digest by default";
+
+    CliRun piped = km({"sign", "--key", path("k.blob"), "--out", "-"}, dir_ / "msg");
+    ASSERT_EQ(piped.status, 0) << piped.err;
+    EXPECT_EQ(Bytes(piped.out.begin(), piped.out.end()), get("mac")) << "stdin to stdout";
+
+    CliRun short_mac =
+        km({"sign", "--key", path("k.blob"), "--mac-length", "128", "--in", path("msg"), "--out", path("mac16")});
+    ASSERT_EQ(short_mac.status, 0) << short_mac.err;
+    const Bytes mac = get("mac");
+    EXPECT_EQ(get("mac16"), Bytes(mac.begin(), mac.begin() + 16));
+    CliRun too_short =
+        km({"sign", "--key", path("k.blob"), "--mac-length", "64", "--in", path("msg"), "--out", path("mac8")});
+    EXPECT_EQ(too_short.status, 1);
+    EXPECT_NE(too_short.err.find("KM_ERROR_INVALID_MAC_LENGTH"), std::string::npos) << too_short.err;
+    EXPECT_FALSE(fs::exists(dir_ / "mac8")) << "no output for a refused operation";
+}
+
+TEST_F(KmctlKeys, VerifyHoldsOnlyForTheSignedBytes) {
+    generate_hmac("k.blob");
+    const Bytes message = pattern(200 * 1024);
+    put("msg", message);
+    ASSERT_EQ(km({"sign", "--key", path("k.blob"), "--in", path("msg"), "--out", path("mac")}).status, 0);
+    ASSERT_EQ(km({"sign", "--key", path("k.blob"), "--mac-length", "160", "--in", path("msg"), "--out", path("mac20")})
+                  .status,
+              0);
+
+    CliRun ok = km({"verify", "--key", path("k.blob"), "--in", path("msg"), "--signature", path("mac")});
+    EXPECT_EQ(ok.status, 0) << ok.err;
+    EXPECT_EQ(ok.out, "");
+    CliRun truncated = km({"verify", "--key", path("k.blob"), "--in", path("msg"), "--signature", path("mac20")});
+    EXPECT_EQ(truncated.status, 0) << "the MAC length follows the signature: " << truncated.err;
+    CliRun from_stdin = km({"verify", "--key", path("k.blob"), "--signature", path("mac")}, dir_ / "msg");
+    EXPECT_EQ(from_stdin.status, 0) << from_stdin.err;
+
+    // One byte changed past the first piece, one byte more, one byte less.
+    std::vector<std::pair<std::string, Bytes>> changed;
+    Bytes flipped = message;
+    flipped[70000] ^= 1;
+    changed.push_back({"flipped", flipped});
+    Bytes longer = message;
+    longer.push_back(0);
+    changed.push_back({"longer", longer});
+    changed.push_back({"shorter", Bytes(message.begin(), message.end() - 1)});
+    for (const auto &[what, bytes] : changed) {
+        SCOPED_TRACE(what);
+        put("changed", bytes);
+        CliRun bad = km({"verify", "--key", path("k.blob"), "--in", path("changed"), "--signature", path("mac")});
+        EXPECT_EQ(bad.status, 1);
+        EXPECT_NE(bad.err.find(kVerificationFailed), std::string::npos) << bad.err;
+        EXPECT_EQ(bad.out, "");
+    }
+    Bytes wrong_mac = get("mac");
+    wrong_mac[0] ^= 0x40;
+    put("wrong-mac", wrong_mac);
+    CliRun bad_mac = km({"verify", "--key", path("k.blob"), "--in", path("msg"), "--signature", path("wrong-mac")});
+    EXPECT_EQ(bad_mac.status, 1);
+    EXPECT_NE(bad_mac.err.find(kVerificationFailed), std::string::npos) << bad_mac.err;
+}
+
+TEST_F(KmctlKeys, ApplicationIdAndDataBindTheKey) {
+    generate_hmac("k.blob", {"--app-id", "alice", "--app-data", "wonderland"});
+    put("msg", pattern(100));
+    const std::vector<std::string> sign = {"sign", "--key", path("k.blob"), "--in", path("msg"), "--out", path("mac")};
+    struct Case {
+        const char *what;
+        std::vector<std::string> binding;
+    };
+    const Case refused[] = {
+        {"neither", {}},
+        {"wrong id", {"--app-id", "bob", "--app-data", "wonderland"}},
+        {"wrong data", {"--app-id", "alice", "--app-data", "land"}},
+        {"id only", {"--app-id", "alice"}},
+    };
+    for (const Case &c : refused) {
+        SCOPED_TRACE(c.what);
+        std::vector<std::string> args = sign;
+        args.insert(args.end(), c.binding.begin(), c.binding.end());
+        for (bool with_length : {false, true}) {
+            // With a MAC length the refusal comes from begin itself.
+            std::vector<std::string> a = args;
+            if (with_length)
+                a.insert(a.end(), {"--mac-length", "256"});
+            CliRun r = km(a);
+            EXPECT_EQ(r.status, 1);
+            EXPECT_NE(r.err.find(kInvalidKeyBlob), std::string::npos) << r.err;
+        }
+        std::vector<std::string> describe = {"characteristics", "--key", path("k.blob")};
+        describe.insert(describe.end(), c.binding.begin(), c.binding.end());
+        EXPECT_EQ(km(describe).status, 1);
+    }
+    std::vector<std::string> args = sign;
+    args.insert(args.end(), {"--app-id", "alice", "--app-data", "wonderland"});
+    CliRun ok = km(args);
+    EXPECT_EQ(ok.status, 0) << ok.err;
+    CliRun verify = km({"verify", "--key", path("k.blob"), "--app-id", "alice", "--app-data", "wonderland", "--in",
+                        path("msg"), "--signature", path("mac")});
+    EXPECT_EQ(verify.status, 0) << verify.err;
+    CliRun chars = km({"characteristics", "--key", path("k.blob"), "--app-id", "alice", "--app-data", "wonderland"});
+    ASSERT_EQ(chars.status, 0) << chars.err;
+    EXPECT_EQ(chars.out.find("KM_TAG_APPLICATION"), std::string::npos) << "hidden by the TA: " << chars.out;
+}
+
+TEST_F(KmctlKeys, BlobsOpenOnlyWithTheStateThatSealedThem) {
+    generate_hmac("k.blob");
+    put("msg", pattern(10));
+    // Every kmctl run is a new process: the blob is reopened from the state directory.
+    ASSERT_EQ(km({"sign", "--key", path("k.blob"), "--in", path("msg"), "--out", path("mac")}).status, 0);
+    ASSERT_EQ(km({"verify", "--key", path("k.blob"), "--in", path("msg"), "--signature", path("mac")}).status, 0);
+
+    CliRun elsewhere = run({"--state", path("other-state"), "characteristics", "--key", path("k.blob")});
+    EXPECT_EQ(elsewhere.status, 3);
+    EXPECT_NE(elsewhere.err.find("TEE_ERROR_MAC_INVALID"), std::string::npos) << elsewhere.err;
+    CliRun tampered_blob = [&] {
+        Bytes blob = get("k.blob");
+        blob[blob.size() / 2] ^= 1;
+        put("tampered.blob", blob);
+        return km({"characteristics", "--key", path("tampered.blob")});
+    }();
+    EXPECT_NE(tampered_blob.status, 0);
+    EXPECT_EQ(tampered_blob.out, "");
+}
+
+TEST_F(KmctlKeys, DeleteOneOrAll) {
+    generate_hmac("k.blob");
+    CliRun one = km({"delete", "--key", path("k.blob")});
+    EXPECT_EQ(one.status, 0) << one.err;
+    EXPECT_EQ(one.out, "");
+    EXPECT_EQ(km({"delete", "--all"}).status, 0);
+    put("short.blob", Bytes{7});
+    CliRun bad = km({"delete", "--key", path("short.blob")});
+    EXPECT_EQ(bad.status, 1);
+    EXPECT_NE(bad.err.find(kInvalidKeyBlob), std::string::npos) << bad.err;
+    CliRun missing = km({"delete", "--key", path("no-such.blob")});
+    EXPECT_EQ(missing.status, 4);
+    EXPECT_NE(missing.err.find("no-such.blob"), std::string::npos) << missing.err;
+}
+
+TEST_F(KmctlKeys, ExportIsRefusedForSymmetricKeys) {
+    generate_hmac("k.blob");
+    CliRun r = km({"export", "--key", path("k.blob"), "--out", path("pub")});
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("KM_ERROR_UNSUPPORTED_KEY_FORMAT (-17)"), std::string::npos) << r.err;
+    EXPECT_FALSE(fs::exists(dir_ / "pub"));
+}
+
+TEST_F(KmctlKeys, EncryptWithASigningKeyLeavesNoOutput) {
+    generate_hmac("k.blob");
+    put("msg", pattern(100));
+    put("out", Bytes{1, 2, 3});
+    CliRun r = km({"encrypt", "--key", path("k.blob"), "--in", path("msg"), "--out", path("out")});
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("KM_ERROR_UNSUPPORTED_PURPOSE"), std::string::npos) << r.err;
+    EXPECT_EQ(get("out"), (Bytes{1, 2, 3})) << "the old output stays";
+    for (const auto &entry : fs::directory_iterator(dir_))
+        EXPECT_EQ(entry.path().filename().string().find(".tmp."), std::string::npos) << entry.path();
+}
+
+// ---- RSA through PKCS#8, export and OpenSSL ----
+
+struct OsslFree {
+    void operator()(EVP_PKEY *p) const { EVP_PKEY_free(p); }
+    void operator()(BIO *p) const { BIO_free(p); }
+    void operator()(EVP_PKEY_CTX *p) const { EVP_PKEY_CTX_free(p); }
+};
+
+TEST_F(KmctlKeys, RsaKeyImportedFromPkcs8ExportsAndSignsForOpenSsl) {
+    std::unique_ptr<EVP_PKEY, OsslFree> key(EVP_PKEY_Q_keygen(nullptr, nullptr, "RSA", size_t{2048}));
+    ASSERT_TRUE(key);
+    std::unique_ptr<BIO, OsslFree> pem(BIO_new(BIO_s_mem()));
+    ASSERT_EQ(PEM_write_bio_PKCS8PrivateKey(pem.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr), 1);
+    char *pem_data = nullptr;
+    long pem_len = BIO_get_mem_data(pem.get(), &pem_data);
+    put("key.pem", Bytes(pem_data, pem_data + pem_len));
+
+    CliRun imported = km({"import", "--algorithm", "rsa", "--digest", "sha256", "--padding", "rsa_pkcs1_1_5_sign",
+                          "--purpose", "sign,verify", "--in", path("key.pem"), "--out", path("rsa.blob")});
+    ASSERT_EQ(imported.status, 0) << imported.err;
+    auto chars = parse_characteristics(km({"characteristics", "--key", path("rsa.blob")}).out);
+    EXPECT_EQ(chars["KM_TAG_KEY_SIZE"], "2048");
+    EXPECT_EQ(chars["KM_TAG_RSA_PUBLIC_EXPONENT"], "65537");
+
+    unsigned char *der = nullptr;
+    int der_len = i2d_PUBKEY(key.get(), &der);
+    ASSERT_GT(der_len, 0);
+    const Bytes spki(der, der + der_len);
+    OPENSSL_free(der);
+    CliRun exported = km({"export", "--key", path("rsa.blob"), "--format", "der", "--out", path("pub.der")});
+    ASSERT_EQ(exported.status, 0) << exported.err;
+    EXPECT_EQ(get("pub.der"), spki);
+    CliRun as_pem = km({"export", "--key", path("rsa.blob"), "--out", "-"});
+    ASSERT_EQ(as_pem.status, 0) << as_pem.err;
+    EXPECT_EQ(as_pem.out.rfind("-----BEGIN PUBLIC KEY-----\n", 0), 0u) << as_pem.out;
+
+    const Bytes message = pattern(150 * 1024);
+    put("msg", message);
+    CliRun sign = km({"sign", "--key", path("rsa.blob"), "--digest", "sha256", "--padding", "rsa_pkcs1_1_5_sign",
+                      "--in", path("msg"), "--out", path("sig")});
+    ASSERT_EQ(sign.status, 0) << sign.err;
+    const Bytes sig = get("sig");
+    std::unique_ptr<EVP_MD_CTX, decltype(&EVP_MD_CTX_free)> md(EVP_MD_CTX_new(), EVP_MD_CTX_free);
+    ASSERT_EQ(EVP_DigestVerifyInit(md.get(), nullptr, EVP_sha256(), nullptr, key.get()), 1);
+    EXPECT_EQ(EVP_DigestVerify(md.get(), sig.data(), sig.size(), message.data(), message.size()), 1)
+        << "OpenSSL accepts the TA's signature";
+    CliRun verify = km({"verify", "--key", path("rsa.blob"), "--digest", "sha256", "--padding", "rsa_pkcs1_1_5_sign",
+                        "--in", path("msg"), "--signature", path("sig")});
+    EXPECT_EQ(verify.status, 0) << verify.err;
+}
+
+// ---- the key commands' command lines ----
+
+TEST_F(KmctlKeys, BadOptionsAreUsageErrorsBeforeAnyTeeStarts) {
+    put("blob", Bytes{1, 2, 3});
+    put("msg", Bytes{1});
+    const std::string blob = path("blob");
+    const std::string msg = path("msg");
+    const std::vector<std::string> gen = {"generate", "--algorithm", "hmac", "--size", "256", "--out", path("k")};
+    auto with = [](std::vector<std::string> base, std::vector<std::string> more) {
+        base.insert(base.end(), more.begin(), more.end());
+        return base;
+    };
+    struct Case {
+        std::vector<std::string> args;
+        const char *message; // a part of stderr
+    };
+    const Case cases[] = {
+        {with(gen, {"--tag", "KM_TAG_BOGUS=1"}), "unknown tag 'KM_TAG_BOGUS'"},
+        {with(gen, {"--tag", "NO_AUTH_REQUIRED=true"}), "takes no value"},
+        {with(gen, {"--tag", "ACTIVE_DATETIME=2026-02-30T00:00:00Z"}), "ISO 8601"},
+        {with(gen, {"--tag", "ACTIVE_DATETIME=2026-01-31T12:00:00+02:00"}), "bad value"},
+        {with(gen, {"--tag", "PURPOSE=sideways"}), "bad value 'sideways' for KM_TAG_PURPOSE"},
+        {with(gen, {"--tag", "APPLICATION_ID=abc"}), "hex"},
+        {with(gen, {"--tag", "KEY_SIZE"}), "needs a value"},
+        {with(gen, {"--tag", "KEY_SIZE=128"}), "KM_TAG_KEY_SIZE may be given only once"},
+        {with(gen, {"--tag", "MIN_MAC_LENGTH=4294967296"}), "32-bit"},
+        {with(gen, {"--digest", "sha256,sha3"}), "--digest: bad value 'sha3'"},
+        {with(gen, {"--size", "big"}), "--size"},
+        {{"generate", "--algorithm", "dsa", "--out", path("k")}, "unknown algorithm 'dsa'"},
+        {{"generate", "--size", "256", "--out", path("k")}, "--algorithm"},
+        {{"generate", "--algorithm", "hmac"}, "--out"},
+        {{"import", "--algorithm", "rsa", "--in", msg, "--out", path("k")}, "PKCS#8"},
+        {{"import", "--algorithm", "ec", "--in", msg, "--out", path("k")}, "PKCS#8"},
+        {{"characteristics"}, "--key"},
+        {{"sign", "--key", blob, "--in", msg}, "--out"},
+        {{"sign", "--key", blob, "--in", msg, "--out", path("s"), "--param", "MAC_LENGTH=x"}, "MAC_LENGTH"},
+        {{"sign", "--key", blob, "--in", msg, "--out", path("s"), "--digest", "sha999"}, "--digest"},
+        {{"sign", "--key", "-", "--out", path("s")}, "--key and --in cannot both read stdin"},
+        {{"verify", "--key", blob, "--in", msg}, "--signature"},
+        {{"verify", "--key", blob, "--signature", "-"}, "--signature and --in cannot both read stdin"},
+        {{"encrypt", "--key", blob, "--in", msg, "--out", path("c"), "--nonce", "xyz"}, "KM_TAG_NONCE"},
+        {{"export", "--key", blob, "--format", "xml", "--out", path("p")}, "xml"},
+        {{"delete"}, "--key BLOB or --all"},
+        {{"delete", "--all", "--key", blob}, "excludes"},
+    };
+    for (const Case &c : cases) {
+        std::string joined;
+        for (const std::string &a : c.args)
+            joined += a + " ";
+        SCOPED_TRACE(joined);
+        CliRun r = km(c.args);
+        EXPECT_EQ(r.status, 2) << r.err;
+        EXPECT_NE(r.err.find(c.message), std::string::npos) << r.err;
+        EXPECT_EQ(r.out, "");
+    }
+    EXPECT_FALSE(fs::exists(state_)) << "a rejected command line opens no TEE";
+    EXPECT_FALSE(fs::exists(dir_ / "k"));
+}
+
+TEST_F(KmctlKeys, EveryCommandHasHelp) {
+    const std::pair<const char *, const char *> commands[] = {
+        {"generate", "--min-mac-length"},
+        {"import", "--in"},
+        {"characteristics", "--json"},
+        {"delete", "--all"},
+        {"export", "--format"},
+        {"sign", "--mac-length"},
+        {"verify", "--signature"},
+        {"encrypt", "--nonce"},
+        {"decrypt", "--aad"},
+    };
+    for (const auto &[command, option] : commands) {
+        SCOPED_TRACE(command);
+        CliRun r = km({command, "--help"});
+        EXPECT_EQ(r.status, 0);
+        EXPECT_NE(r.out.find(option), std::string::npos) << r.out;
+    }
+    CliRun top = km({"--help"});
+    for (const auto &[command, option] : commands)
+        EXPECT_NE(top.out.find(command), std::string::npos) << command;
+    EXPECT_FALSE(fs::exists(state_));
 }
 
 } // namespace

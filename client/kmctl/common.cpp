@@ -45,16 +45,19 @@ void add_global_options(CLI::App &app, GlobalOptions &options) {
                    "Directory of the TEE's persistent state (default: $KMCTL_STATE, $XDG_STATE_HOME/kmctl "
                    "or ~/.local/state/kmctl)")
         ->type_name("DIR");
-    static const std::map<std::string, int> kLevels = {
-        {"error", TEE_TRACE_ERROR}, {"info", TEE_TRACE_INFO}, {"debug", TEE_TRACE_DEBUG}, {"flow", TEE_TRACE_FLOW}};
+    static const std::map<std::string, int> kLevels = {{"none", 0},
+                                                       {"error", TEE_TRACE_ERROR},
+                                                       {"info", TEE_TRACE_INFO},
+                                                       {"debug", TEE_TRACE_DEBUG},
+                                                       {"flow", TEE_TRACE_FLOW}};
     app.add_option_function<std::string>(
            "--log-level",
            [&options](const std::string &level) {
                auto it = kLevels.find(level);
                options.trace_level = it == kLevels.end() ? TEE_TRACE_ERROR : it->second;
            },
-           "Platform trace lines shown on stderr: error, info, debug or flow (default: error)")
-        ->check(CLI::IsMember({"error", "info", "debug", "flow"}))
+           "Platform trace lines shown on stderr: none, error, info, debug or flow (default: error)")
+        ->check(CLI::IsMember({"none", "error", "info", "debug", "flow"}))
         ->type_name("LEVEL");
 }
 
@@ -77,6 +80,10 @@ Session::Session(const GlobalOptions &options) : tee_(start_tee(options)), clien
     check(opened);
 }
 
+void usage_error(const std::string &message) {
+    throw Failure(kExitUsage, message + "\nRun with --help for more information.");
+}
+
 void check(const km::Status &status) {
     if (status.tee_failed())
         throw Failure(kExitTeeFailure, km::describe(status));
@@ -84,14 +91,30 @@ void check(const km::Status &status) {
         throw Failure(kExitRefused, km::describe(status));
 }
 
-CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what) {
+CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what, bool required) {
     path = "-";
-    return app.add_option("--in", path, what + " (- for stdin, the default)")->type_name("FILE");
+    CLI::Option *o = app.add_option("--in", path, what + (required ? " (- for stdin)" : " (- for stdin, the default)"))
+                         ->type_name("FILE");
+    return required ? o->required() : o;
 }
 
-CLI::Option *add_out_option(CLI::App &app, std::string &path, const std::string &what) {
+CLI::Option *add_out_option(CLI::App &app, std::string &path, const std::string &what, bool required) {
     path = "-";
-    return app.add_option("--out", path, what + " (- for stdout, the default)")->type_name("FILE");
+    CLI::Option *o =
+        app.add_option("--out", path, what + (required ? " (- for stdout)" : " (- for stdout, the default)"))
+            ->type_name("FILE");
+    return required ? o->required() : o;
+}
+
+void check_one_stdin(std::initializer_list<std::pair<const char *, const std::string *>> inputs) {
+    std::string first;
+    for (const auto &[option, path] : inputs) {
+        if (*path != "-")
+            continue;
+        if (!first.empty())
+            usage_error(first + " and " + option + " cannot both read stdin");
+        first = option;
+    }
 }
 
 std::vector<uint8_t> read_input(const std::string &path) {
@@ -142,6 +165,88 @@ void write_output(const std::string &path, std::span<const uint8_t> data) {
 
 void write_output(const std::string &path, std::string_view text) {
     write_output(path, std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(text.data()), text.size()));
+}
+
+void wipe(std::vector<uint8_t> &bytes) {
+    explicit_bzero(bytes.data(), bytes.size());
+    bytes.clear();
+}
+
+std::vector<uint8_t> text_bytes(const std::string &text) {
+    return std::vector<uint8_t>(text.begin(), text.end());
+}
+
+InputStream::InputStream(const std::string &path) : name_(path == "-" ? "stdin" : path) {
+    if (path == "-") {
+        file_ = stdin;
+        return;
+    }
+    file_ = std::fopen(path.c_str(), "rb");
+    if (!file_)
+        throw Failure(kExitLocal, "cannot open " + path + ": " + std::strerror(errno));
+    owned_ = true;
+}
+
+InputStream::~InputStream() {
+    if (owned_)
+        std::fclose(file_);
+}
+
+size_t InputStream::read(uint8_t *buf, size_t n) {
+    size_t got = 0;
+    while (got < n) {
+        size_t r = std::fread(buf + got, 1, n - got, file_);
+        if (r == 0)
+            break;
+        got += r;
+    }
+    if (std::ferror(file_))
+        throw Failure(kExitLocal, "cannot read " + name_);
+    return got;
+}
+
+OutputStream::OutputStream(const std::string &path) : path_(path) {
+    if (path == "-") {
+        file_ = stdout;
+        return;
+    }
+    // Written beside the target and renamed, as write_output does.
+    temp_ = path + ".tmp." + std::to_string(::getpid());
+    file_ = std::fopen(temp_.c_str(), "wb");
+    if (!file_)
+        throw Failure(kExitLocal, "cannot write " + path + ": " + std::strerror(errno));
+}
+
+OutputStream::~OutputStream() {
+    if (temp_.empty() || committed_)
+        return;
+    std::fclose(file_);
+    std::remove(temp_.c_str());
+}
+
+void OutputStream::write(std::span<const uint8_t> data) {
+    if (data.empty())
+        return;
+    if (std::fwrite(data.data(), 1, data.size(), file_) != data.size())
+        throw Failure(kExitLocal, "cannot write " + (temp_.empty() ? std::string("stdout") : path_));
+}
+
+void OutputStream::commit() {
+    if (temp_.empty()) {
+        if (std::fflush(stdout) != 0)
+            throw Failure(kExitLocal, "cannot write stdout");
+        committed_ = true;
+        return;
+    }
+    int closed = std::fclose(file_);
+    committed_ = true;
+    std::error_code ec;
+    if (closed == 0)
+        std::filesystem::rename(temp_, path_, ec);
+    if (closed != 0 || ec) {
+        std::remove(temp_.c_str());
+        throw Failure(kExitLocal, "cannot write " + path_ + (ec ? ": " + ec.message() : std::string()));
+    }
 }
 
 } // namespace kmctl

@@ -6,8 +6,10 @@
 #define KMCTL_COMMON_H
 
 #include <cstdint>
+#include <cstdio>
 #include <filesystem>
 #include <functional>
+#include <initializer_list>
 #include <memory>
 #include <span>
 #include <stdexcept>
@@ -67,6 +69,10 @@ private:
     km::Client client_;
 };
 
+// usage_error - throws Failure with the usage exit code; the message is
+// followed by a pointer to --help, as CLI11's own errors are.
+[[noreturn]] void usage_error(const std::string &message);
+
 // check - returns for an ok status; throws Failure with describe(status)
 // and the refusal or TEE-failure exit code otherwise.
 void check(const km::Status &status);
@@ -78,9 +84,13 @@ template <typename T> T take(km::Result<T> result) {
 }
 
 // add_in_option / add_out_option - --in FILE / --out FILE on a subcommand,
-// defaulting to "-" (stdin / stdout).
-CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what);
-CLI::Option *add_out_option(CLI::App &app, std::string &path, const std::string &what);
+// defaulting to "-" (stdin / stdout) unless required.
+CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what, bool required = false);
+CLI::Option *add_out_option(CLI::App &app, std::string &path, const std::string &what, bool required = false);
+
+// check_one_stdin - refuses (usage) when more than one of the named
+// inputs is "-": stdin can be read only once.
+void check_one_stdin(std::initializer_list<std::pair<const char *, const std::string *>> inputs);
 
 // read_input - the whole of a file, or of stdin for "-". Throws Failure
 // (local) when it cannot be read.
@@ -91,6 +101,52 @@ std::vector<uint8_t> read_input(const std::string &path);
 void write_output(const std::string &path, std::span<const uint8_t> data);
 void write_output(const std::string &path, std::string_view text);
 
+// wipe - overwrites bytes that held key material, in a way the compiler
+// keeps, and empties the vector.
+void wipe(std::vector<uint8_t> &bytes);
+
+// text_bytes - the bytes of a command-line text, as given.
+std::vector<uint8_t> text_bytes(const std::string &text);
+
+// InputStream - a file, or stdin for "-", read piece by piece so that
+// large inputs never sit in memory whole. Throws Failure (local) when the
+// file cannot be opened or read.
+class InputStream {
+public:
+    explicit InputStream(const std::string &path);
+    ~InputStream();
+    InputStream(const InputStream &) = delete;
+    InputStream &operator=(const InputStream &) = delete;
+
+    // read - up to n bytes into buf; fewer only at the end, 0 once it is reached.
+    size_t read(uint8_t *buf, size_t n);
+
+private:
+    std::FILE *file_ = nullptr;
+    bool owned_ = false;
+    std::string name_;
+};
+
+// OutputStream - stdout for "-", else a temporary file beside path that
+// commit renames into place; destroyed without commit, it removes the
+// temporary and leaves path as it was. Throws Failure (local).
+class OutputStream {
+public:
+    explicit OutputStream(const std::string &path);
+    ~OutputStream();
+    OutputStream(const OutputStream &) = delete;
+    OutputStream &operator=(const OutputStream &) = delete;
+
+    void write(std::span<const uint8_t> data);
+    void commit();
+
+private:
+    std::FILE *file_ = nullptr;
+    std::string path_;
+    std::string temp_; // empty for stdout
+    bool committed_ = false;
+};
+
 // Command - a subcommand's CLI11 app and what runs when it is chosen.
 struct Command {
     CLI::App *app;
@@ -99,6 +155,15 @@ struct Command {
 
 // The subcommands, one source file each.
 Command add_info(CLI::App &kmctl, const GlobalOptions &options);
+Command add_generate(CLI::App &kmctl, const GlobalOptions &options);
+Command add_import(CLI::App &kmctl, const GlobalOptions &options);
+Command add_characteristics(CLI::App &kmctl, const GlobalOptions &options);
+Command add_delete(CLI::App &kmctl, const GlobalOptions &options);
+Command add_export(CLI::App &kmctl, const GlobalOptions &options);
+Command add_sign(CLI::App &kmctl, const GlobalOptions &options);
+Command add_verify(CLI::App &kmctl, const GlobalOptions &options);
+Command add_encrypt(CLI::App &kmctl, const GlobalOptions &options);
+Command add_decrypt(CLI::App &kmctl, const GlobalOptions &options);
 
 } // namespace kmctl
 

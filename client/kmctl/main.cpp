@@ -16,7 +16,11 @@ int main(int argc, char **argv) {
     app.fallthrough();
 
     std::vector<kmctl::Command> commands = {
-        kmctl::add_info(app, options),
+        kmctl::add_info(app, options),    kmctl::add_generate(app, options),
+        kmctl::add_import(app, options),  kmctl::add_characteristics(app, options),
+        kmctl::add_delete(app, options),  kmctl::add_export(app, options),
+        kmctl::add_sign(app, options),    kmctl::add_verify(app, options),
+        kmctl::add_encrypt(app, options), kmctl::add_decrypt(app, options),
     };
 
     try {

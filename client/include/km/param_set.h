@@ -11,6 +11,8 @@
 #include <optional>
 #include <vector>
 
+#include "km/names.h"
+
 namespace km {
 
 using Bytes = std::vector<uint8_t>;
@@ -21,7 +23,6 @@ struct Param {
     Bytes bytes;        // byte strings and big numbers
 };
 
-inline uint32_t tag_type(uint32_t tag) { return tag & 0xF0000000u; }
 inline bool tag_is_bytes(uint32_t tag) { return tag_type(tag) == 0x80000000u || tag_type(tag) == 0x90000000u; }
 
 class ParamSet {

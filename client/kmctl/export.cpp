@@ -1,0 +1,50 @@
+/*
+ * export.cpp - `kmctl export`: the public key of an RSA or EC key as an
+ * X.509 SubjectPublicKeyInfo (command 20), DER or PEM.
+ */
+#include <memory>
+
+#include "common.h"
+#include "keymaster_defs.h"
+#include "key_options.h"
+#include "km/key_material.h"
+
+namespace kmctl {
+namespace {
+
+struct ExportOptions {
+    KeyOptions key;
+    std::string format = "pem";
+    std::string out;
+};
+
+} // namespace
+
+Command add_export(CLI::App &kmctl, const GlobalOptions &options) {
+    auto o = std::make_shared<ExportOptions>();
+    CLI::App *app = kmctl.add_subcommand("export", "Write the public key of an RSA or EC key");
+    add_key_options(*app, o->key);
+    app->add_option("--format", o->format, "pem (default) or der")
+        ->check(CLI::IsMember({"pem", "der"}))
+        ->type_name("FORMAT");
+    add_out_option(*app, o->out, "The public key", true);
+    return {app, [o, &options] {
+                km::KeyReference key = key_reference(o->key);
+                Session session(options);
+                // The TA's refusal (a symmetric key, say) comes first and as it is.
+                km::Bytes exported = take(session.client().export_key(key));
+                km::ParamSet chars = take(session.client().characteristics(key));
+                const km::Param *algorithm = chars.find(KM_TAG_ALGORITHM);
+                std::string why;
+                std::optional<km::Bytes> der =
+                    km::public_key_der(algorithm ? static_cast<uint32_t>(algorithm->value) : 0, exported, &why);
+                if (!der)
+                    throw Failure(kExitTeeFailure, km::describe({TEE_ERROR_BAD_FORMAT, 0}) + ": " + why);
+                if (o->format == "der")
+                    write_output(o->out, *der);
+                else
+                    write_output(o->out, km::pem_encode("PUBLIC KEY", *der));
+            }};
+}
+
+} // namespace kmctl

@@ -1,0 +1,119 @@
+/*
+ * param_options.cpp - options that become key parameters.
+ */
+#include "param_options.h"
+
+#include "common.h"
+#include "keymaster_defs.h"
+#include "km/names.h"
+#include "km/param_text.h"
+
+namespace kmctl {
+
+void add_param_text(km::ParamSet &set, std::string_view option, const std::string &text) {
+    std::string why;
+    std::optional<km::Param> p = km::parse_param(text, &why);
+    if (!p)
+        usage_error(std::string(option) + ": " + why);
+    if (km::tag_is_bytes(p->tag))
+        set.add_bytes(p->tag, std::move(p->bytes));
+    else
+        set.add(p->tag, p->value);
+}
+
+void add_tag_value(km::ParamSet &set, std::string_view option, std::string_view tag, const std::string &value) {
+    add_param_text(set, option, std::string(tag) + "=" + value);
+}
+
+CLI::Option *add_list_option(CLI::App &app, const std::string &name, std::vector<std::string> &values,
+                             const std::string &help) {
+    // One value per occurrence: a following word is never swallowed.
+    return app.add_option(name, values, help)->delimiter(',')->allow_extra_args(false)->type_name("LIST");
+}
+
+void check_single_tags(const km::ParamSet &set) {
+    if (std::optional<uint32_t> tag = km::repeated_single_tag(set))
+        usage_error(km::tag_name(*tag) + " may be given only once");
+}
+
+void add_new_key_options(CLI::App &app, NewKeyOptions &desc) {
+    app.add_option("--algorithm", desc.algorithm, "Key algorithm: rsa, ec, aes or hmac")->required()->type_name("ALG");
+    app.add_option("--size", desc.size, "Key size in bits (KM_TAG_KEY_SIZE)")->type_name("BITS");
+    add_list_option(app, "--purpose", desc.purposes,
+                    "Purposes: encrypt, decrypt, sign, verify (default: all the algorithm has)");
+    add_list_option(app, "--digest", desc.digests, "Digests: none, md5, sha1, sha224, sha256, sha384, sha512");
+    add_list_option(app, "--padding", desc.paddings,
+                    "Paddings: none, rsa_oaep, rsa_pss, rsa_pkcs1_1_5_encrypt, rsa_pkcs1_1_5_sign, pkcs7");
+    add_list_option(app, "--block-mode", desc.block_modes, "Block modes: ecb, cbc, ctr, gcm");
+    app.add_option("--min-mac-length", desc.min_mac_length, "Shortest MAC or GCM tag allowed, in bits")
+        ->type_name("BITS");
+    app.add_option("--exponent", desc.exponent, "RSA public exponent (KM_TAG_RSA_PUBLIC_EXPONENT)")->type_name("E");
+    app.add_option_function<std::string>(
+           "--app-id",
+           [&desc](const std::string &v) {
+               desc.app_id = v;
+               desc.has_app_id = true;
+           },
+           "Bind the key to this application id; every later use must give it")
+        ->type_name("TEXT");
+    app.add_option_function<std::string>(
+           "--app-data",
+           [&desc](const std::string &v) {
+               desc.app_data = v;
+               desc.has_app_data = true;
+           },
+           "Bind the key to this application data; every later use must give it")
+        ->type_name("TEXT");
+    app.add_option("--tag", desc.tags, "Any key parameter, NAME[=VALUE]; repeatable")
+        ->allow_extra_args(false)
+        ->type_name("NAME[=VALUE]");
+}
+
+km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool generating) {
+    std::optional<uint32_t> alg = km::parse_enum(km::Enumeration::algorithm, desc.algorithm);
+    if (!alg)
+        usage_error("--algorithm: unknown algorithm '" + desc.algorithm + "': expected rsa, ec, aes or hmac");
+    *algorithm = *alg;
+
+    km::ParamSet set;
+    set.add(KM_TAG_ALGORITHM, *alg);
+    if (!desc.size.empty())
+        add_tag_value(set, "--size", "KM_TAG_KEY_SIZE", desc.size);
+    if (desc.purposes.empty()) {
+        std::vector<uint32_t> all;
+        if (*alg == KM_ALGORITHM_RSA || *alg == KM_ALGORITHM_AES)
+            all.insert(all.end(), {KM_PURPOSE_ENCRYPT, KM_PURPOSE_DECRYPT});
+        if (*alg == KM_ALGORITHM_RSA || *alg == KM_ALGORITHM_EC || *alg == KM_ALGORITHM_HMAC)
+            all.insert(all.end(), {KM_PURPOSE_SIGN, KM_PURPOSE_VERIFY});
+        for (uint32_t p : all)
+            set.add(KM_TAG_PURPOSE, p);
+    }
+    for (const std::string &p : desc.purposes)
+        add_tag_value(set, "--purpose", "KM_TAG_PURPOSE", p);
+    for (const std::string &d : desc.digests)
+        add_tag_value(set, "--digest", "KM_TAG_DIGEST", d);
+    for (const std::string &p : desc.paddings)
+        add_tag_value(set, "--padding", "KM_TAG_PADDING", p);
+    for (const std::string &m : desc.block_modes)
+        add_tag_value(set, "--block-mode", "KM_TAG_BLOCK_MODE", m);
+    if (!desc.min_mac_length.empty())
+        add_tag_value(set, "--min-mac-length", "KM_TAG_MIN_MAC_LENGTH", desc.min_mac_length);
+    if (!desc.exponent.empty())
+        add_tag_value(set, "--exponent", "KM_TAG_RSA_PUBLIC_EXPONENT", desc.exponent);
+    if (desc.has_app_id)
+        set.add_bytes(KM_TAG_APPLICATION_ID, text_bytes(desc.app_id));
+    if (desc.has_app_data)
+        set.add_bytes(KM_TAG_APPLICATION_DATA, text_bytes(desc.app_data));
+    for (const std::string &t : desc.tags)
+        add_param_text(set, "--tag", t);
+    // The TA wants an exponent; an import reads it from the key instead.
+    if (generating && *alg == KM_ALGORITHM_RSA && !set.find(KM_TAG_RSA_PUBLIC_EXPONENT))
+        set.add(KM_TAG_RSA_PUBLIC_EXPONENT, 65537);
+    // A key with neither is refused every operation for want of an auth token.
+    if (!set.find(KM_TAG_NO_AUTH_REQUIRED) && !set.find(KM_TAG_USER_SECURE_ID))
+        set.add_bool(KM_TAG_NO_AUTH_REQUIRED);
+    check_single_tags(set);
+    return set;
+}
+
+} // namespace kmctl

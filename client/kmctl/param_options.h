@@ -1,0 +1,69 @@
+/*
+ * param_options.h - command-line options that become key parameters:
+ * --tag/--param NAME[=VALUE], and the named options of generate and import.
+ * Every function here throws Failure (usage) for a bad value, before any
+ * TEE is opened.
+ */
+#ifndef KMCTL_PARAM_OPTIONS_H
+#define KMCTL_PARAM_OPTIONS_H
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include <CLI/CLI.hpp>
+
+#include "km/param_set.h"
+
+namespace kmctl {
+
+// add_param_text - appends the parameter "NAME[=VALUE]" that option
+// (for the message) gave.
+void add_param_text(km::ParamSet &set, std::string_view option, const std::string &text);
+
+// add_tag_value - appends tag=value, the value as its type reads it
+// (km::parse_param); used by the named options.
+void add_tag_value(km::ParamSet &set, std::string_view option, std::string_view tag, const std::string &value);
+
+// add_list_option - a repeatable option whose values may also be
+// comma-separated lists ("--digest sha256,sha512").
+CLI::Option *add_list_option(CLI::App &app, const std::string &name, std::vector<std::string> &values,
+                             const std::string &help);
+
+// check_single_tags - refuses a set that holds a non-repeatable tag twice.
+void check_single_tags(const km::ParamSet &set);
+
+// NewKeyOptions - the options that describe a key to generate or import.
+struct NewKeyOptions {
+    std::string algorithm;
+    std::string size;
+    std::vector<std::string> purposes;
+    std::vector<std::string> digests;
+    std::vector<std::string> paddings;
+    std::vector<std::string> block_modes;
+    std::string min_mac_length;
+    std::string exponent;
+    std::string app_id;
+    std::string app_data;
+    bool has_app_id = false;
+    bool has_app_data = false;
+    std::vector<std::string> tags;
+};
+
+// add_new_key_options - --algorithm (required), --size, --purpose,
+// --digest, --padding, --block-mode, --min-mac-length, --exponent,
+// --app-id, --app-data and --tag on app.
+void add_new_key_options(CLI::App &app, NewKeyOptions &desc);
+
+// key_params - the key's parameter set. Without --purpose the key gets
+// every purpose its algorithm has; without KM_TAG_NO_AUTH_REQUIRED or
+// KM_TAG_USER_SECURE_ID among the tags it gets KM_TAG_NO_AUTH_REQUIRED,
+// so that it can be used without an auth token. When generating an RSA
+// key without an exponent, the exponent is 65537. *algorithm receives the
+// algorithm's value.
+km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool generating);
+
+} // namespace kmctl
+
+#endif
