@@ -11,6 +11,9 @@
 
 TEE_ObjectHandle derived_ksk = nullptr;
 TEE_ObjectHandle rpmb_ksk = nullptr;
+// One keyed MAC operation per KSK for the instance's life: every blob derives its key with it.
+static TEE_OperationHandle derived_ksk_mac = nullptr;
+static TEE_OperationHandle rpmb_ksk_mac = nullptr;
 
 namespace {
 
@@ -202,32 +205,43 @@ void key_store_deinit() {
         TEE_FreeTransientObject(rpmb_ksk);
     derived_ksk = nullptr;
     rpmb_ksk = nullptr;
+    if (derived_ksk_mac)
+        TEE_FreeOperation(derived_ksk_mac);
+    if (rpmb_ksk_mac)
+        TEE_FreeOperation(rpmb_ksk_mac);
+    derived_ksk_mac = nullptr;
+    rpmb_ksk_mac = nullptr;
 }
 
 TEE_Result TEE_DeriveKK(TEE_ObjectHandle ksk, const uint8_t *input, TEE_ObjectHandle *kk) {
-    operation_guard op;
     uint8_t mac[32] = {};
     uint32_t mac_len = sizeof mac;
     scope_exit wipe([&] { TEE_MemFill(mac, 0, sizeof mac); });
     *kk = nullptr;
 
-    TEE_Result res = TEE_AllocateOperation(op.out(), TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateOperation failed with 0x%08x\n", res);
-        return res;
+    TEE_OperationHandle *slot = ksk == rpmb_ksk ? &rpmb_ksk_mac : &derived_ksk_mac;
+    TEE_Result res = TEE_SUCCESS;
+    if (!*slot) {
+        res = TEE_AllocateOperation(slot, TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("AllocateOperation failed with 0x%08x\n", res);
+            *slot = nullptr;
+            return res;
+        }
+        res = TEE_SetOperationKey(*slot, ksk);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("SetOperationKey failed with 0x%08x\n", res);
+            TEE_FreeOperation(*slot);
+            *slot = nullptr;
+            return res;
+        }
     }
-    res = TEE_SetOperationKey(op.get(), ksk);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("SetOperationKey failed with 0x%08x\n", res);
-        return res;
-    }
-    TEE_MACInit(op.get(), nullptr, 0);
-    res = TEE_MACComputeFinal(op.get(), input, kBlobDeriveSize, mac, &mac_len);
+    TEE_MACInit(*slot, nullptr, 0);
+    res = TEE_MACComputeFinal(*slot, input, kBlobDeriveSize, mac, &mac_len);
     if (res != TEE_SUCCESS) {
         KM_ERR("MACComputeFinal failed with 0x%08x\n", res);
         return res;
     }
-    op.reset();
     if (mac_len != sizeof mac) {
         KM_ERR("Wrong MAC length, expected %dB, got %dB\n", static_cast<int>(sizeof mac), static_cast<int>(mac_len));
         return TEE_ERROR_BAD_PARAMETERS;

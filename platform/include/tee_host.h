@@ -53,6 +53,9 @@ struct Globals;
 // platform holds and zeroes the cache's counters; the Tee calls it as it
 // shuts down.
 void rsa_cache_clear();
+// mac_cache_clear - frees every keyed HMAC context the platform keeps and
+// wipes the keys it held; called when the Tee shuts down.
+void mac_cache_clear();
 }
 
 class Tee {

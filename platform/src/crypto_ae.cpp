@@ -19,6 +19,14 @@ constexpr uint32_t kMinTagBits = 32;
 constexpr uint32_t kMaxTagBits = 128;
 constexpr uint32_t kMaxNonce = 128; // the backend's limit
 
+// Fetched once per key size, not at every Init.
+EVP_CIPHER *shared_gcm(uint32_t bits) {
+    static EVP_CIPHER *c128 = EVP_CIPHER_fetch(nullptr, "AES-128-GCM", nullptr);
+    static EVP_CIPHER *c192 = EVP_CIPHER_fetch(nullptr, "AES-192-GCM", nullptr);
+    static EVP_CIPHER *c256 = EVP_CIPHER_fetch(nullptr, "AES-256-GCM", nullptr);
+    return bits == 128 ? c128 : bits == 192 ? c192 : bits == 256 ? c256 : nullptr;
+}
+
 class AeEngine final : public Engine {
 public:
     explicit AeEngine(EVP_CIPHER_CTX *ctx) : ctx_(ctx) {}
@@ -55,7 +63,9 @@ public:
         reset();
         // Kept by the engine: the context holds no reference of its own.
         EVP_CIPHER_free(cipher_);
-        cipher_ = EVP_CIPHER_fetch(nullptr, aes_cipher_name(static_cast<uint32_t>(key.size() * 8), "GCM"), nullptr);
+        cipher_ = shared_gcm(static_cast<uint32_t>(key.size() * 8));
+        if (cipher_ && EVP_CIPHER_up_ref(cipher_) != 1)
+            cipher_ = nullptr;
         int enc = encrypt ? 1 : 0;
         // The nonce length must be known before the nonce is given.
         size_t iv_len = nonce_len;

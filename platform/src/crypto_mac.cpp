@@ -4,10 +4,60 @@
 #include <openssl/core_names.h>
 #include <openssl/params.h>
 
+#include <cstring>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include <openssl/crypto.h>
+
 #include "operation_internal.h"
 
 namespace tee_host::detail {
 namespace {
+
+EVP_MAC *shared_hmac() {
+    static EVP_MAC *mac = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
+    return mac;
+}
+
+// Keyed HMAC contexts by hash and key, so that a key seen again (a key-store
+// key on every blob, a key used again) skips the digest lookup and the key
+// pads. Platform memory only; wiped when the Tee shuts down.
+struct KeyedCache {
+    std::mutex mu;
+    struct Entry { const char *hash; SecretBytes key; EVP_MAC_CTX *ctx; };
+    std::vector<Entry> entries;
+    size_t next = 0;
+};
+KeyedCache &keyed_cache() { static KeyedCache c; return c; }
+
+EVP_MAC_CTX *keyed_ctx(const char *hash, const SecretBytes &key) {
+    KeyedCache &c = keyed_cache();
+    {
+        std::lock_guard<std::mutex> lock(c.mu);
+        for (auto &e : c.entries)
+            if (e.hash == hash && e.key.size() == key.size() && CRYPTO_memcmp(e.key.data(), key.data(), key.size()) == 0)
+                return EVP_MAC_CTX_dup(e.ctx);
+    }
+    OSSL_PARAM params[] = {
+        OSSL_PARAM_construct_utf8_string(OSSL_MAC_PARAM_DIGEST, const_cast<char *>(hash), 0),
+        OSSL_PARAM_construct_end(),
+    };
+    EVP_MAC_CTX *ctx = EVP_MAC_CTX_new(shared_hmac());
+    if (!ctx || EVP_MAC_init(ctx, key.data(), key.size(), params) != 1)
+        panic("the MAC backend failed to start");
+    EVP_MAC_CTX *tmpl = EVP_MAC_CTX_dup(ctx);
+    std::lock_guard<std::mutex> lock(c.mu);
+    if (c.entries.size() < 8) {
+        c.entries.push_back({hash, key, tmpl});
+    } else {
+        auto &e = c.entries[c.next++ % 8];
+        EVP_MAC_CTX_free(e.ctx);
+        e = {hash, key, tmpl};
+    }
+    return ctx;
+}
 
 // The widest key any HMAC operation takes: that of a generic secret.
 constexpr uint32_t kMaxGenericBits = 4096;
@@ -27,7 +77,13 @@ public:
     }
 
     // The context holds the keyed state, so it goes rather than lingers.
+    // The keyed context outlives a computation: re-initialising it without
+    // a key drops the message state and keeps the pads.
     void reset() override {
+        if (ctx_ && EVP_MAC_init(ctx_, nullptr, 0, nullptr) != 1)
+            panic("the MAC backend failed to reset");
+    }
+    void rekey() override {
         EVP_MAC_CTX_free(ctx_);
         ctx_ = nullptr;
     }
@@ -42,13 +98,9 @@ public:
     }
 
     void init(const SecretBytes &key) {
-        reset();
-        OSSL_PARAM params[] = {
-            OSSL_PARAM_construct_utf8_string(OSSL_MAC_PARAM_DIGEST, const_cast<char *>(hash_.name), 0),
-            OSSL_PARAM_construct_end(),
-        };
-        ctx_ = EVP_MAC_CTX_new(mac_);
-        if (!ctx_ || EVP_MAC_init(ctx_, key.data(), key.size(), params) != 1)
+        if (!ctx_)
+            ctx_ = keyed_ctx(hash_.name, key);
+        if (!ctx_ || EVP_MAC_init(ctx_, nullptr, 0, nullptr) != 1)
             panic("the MAC backend failed to start");
     }
 
@@ -96,13 +148,22 @@ TEE_Result mac_setup(Operation &op) {
     if (!secret_object_type(h->hmac_type)->size_ok(max) &&
         !(max >= 8 && max <= kMaxGenericBits && max % 8 == 0))
         return TEE_ERROR_NOT_SUPPORTED;
-    EVP_MAC *mac = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
-    if (!mac)
+    EVP_MAC *mac = shared_hmac();
+    if (!mac || EVP_MAC_up_ref(mac) != 1)
         return TEE_ERROR_OUT_OF_MEMORY;
     op.engine = std::make_unique<MacEngine>(*h, mac);
     op.info.digestLength = h->size;
     op.info.requiredKeyUsage = TEE_USAGE_MAC;
     return TEE_SUCCESS;
+}
+
+void mac_cache_clear() {
+    KeyedCache &c = keyed_cache();
+    std::lock_guard<std::mutex> lock(c.mu);
+    for (auto &e : c.entries)
+        EVP_MAC_CTX_free(e.ctx);
+    c.entries.clear(); // SecretBytes wipe the keys
+    c.next = 0;
 }
 
 } // namespace tee_host::detail

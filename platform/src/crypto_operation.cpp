@@ -310,7 +310,7 @@ TEE_Result TEE_SetOperationKey(TEE_OperationHandle operation, TEE_ObjectHandle k
     if (op.active)
         panic("TEE_SetOperationKey on an active operation");
     if (!key) {
-        op.engine->reset();
+        op.engine->rekey();
         op.key.reset();
         op.info.keySize = 0;
         op.info.handleState &= ~(TEE_HANDLE_FLAG_KEY_SET | TEE_HANDLE_FLAG_INITIALIZED);
@@ -330,7 +330,7 @@ TEE_Result TEE_SetOperationKey(TEE_OperationHandle operation, TEE_ObjectHandle k
         if (res != TEE_SUCCESS)
             return res;
     }
-    op.engine->reset();
+    op.engine->rekey();
     op.key = copy_key(obj);
     op.info.keySize = obj.key_size;
     op.info.handleState |= TEE_HANDLE_FLAG_KEY_SET;

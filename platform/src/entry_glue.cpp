@@ -154,6 +154,7 @@ Tee::~Tee() {
         close_session(id);
     std::memset(impl_->globals.boot_seed, 0, sizeof impl_->globals.boot_seed);
     detail::rsa_cache_clear();
+    detail::mac_cache_clear();
     g_current = nullptr;
     if (!impl_->temp_dir.empty()) {
         std::error_code ec;

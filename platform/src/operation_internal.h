@@ -35,6 +35,8 @@ public:
     // reset - abandons any computation in progress, wiping its state. The
     // key (op.key) stays; engines read it again at their Init.
     virtual void reset() = 0;
+    // rekey - the key is changing: drop anything derived from the old one.
+    virtual void rekey() { reset(); }
     // clone - a deep copy of the engine's state for TEE_CopyOperation.
     // Panics when the backend cannot copy.
     virtual std::unique_ptr<Engine> clone() const = 0;

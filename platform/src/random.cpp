@@ -6,6 +6,7 @@
 #include <deque>
 #include <mutex>
 
+#include <openssl/crypto.h>
 #include <openssl/rand.h>
 
 #include "platform_internal.h"
@@ -15,6 +16,8 @@ namespace {
 struct RngState {
     std::mutex mu;
     std::deque<uint8_t> scripted;
+    uint8_t pool[512];
+    size_t pool_left = 0; // unread bytes at the end of pool
 };
 RngState &state() {
     static RngState s;
@@ -63,7 +66,23 @@ void TEE_GenerateRandom(void *randomBuffer, uint32_t randomBufferLen) {
             s.scripted.pop_front();
         }
     }
-    detail::system_random(out + done, randomBufferLen - done);
+    // Small requests come from a pool refilled in bulk (one RAND_bytes call
+    // costs as much as a MAC); each byte handed out is wiped from the pool.
+    uint32_t rest = randomBufferLen - done;
+    if (rest > 64) {
+        detail::system_random(out + done, rest);
+        return;
+    }
+    RngState &s = state();
+    std::lock_guard<std::mutex> lock(s.mu);
+    if (s.pool_left < rest) {
+        detail::system_random(s.pool, sizeof s.pool);
+        s.pool_left = sizeof s.pool;
+    }
+    uint8_t *from = s.pool + sizeof s.pool - s.pool_left;
+    std::memcpy(out + done, from, rest);
+    OPENSSL_cleanse(from, rest);
+    s.pool_left -= rest;
 }
 
 TEE_Result TEE_GetBootSeed(void *buf, uint32_t len) {

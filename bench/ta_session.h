@@ -1,0 +1,87 @@
+/*
+ * ta_session.h - the Keymaster TA on an in-process TEE for benchmarks, and
+ * a whole operation (begin, update, finish) with its requests built once so
+ * that a timed iteration is only the three commands.
+ */
+#ifndef KM_BENCH_TA_SESSION_H
+#define KM_BENCH_TA_SESSION_H
+
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "km/param_set.h"
+#include "tee_host.h"
+
+namespace bench {
+
+using Bytes = std::vector<uint8_t>;
+
+// What a command left in params[0] and how much it wrote to params[2].
+struct Reply {
+    TEE_Result res = TEE_SUCCESS;
+    int32_t error = 0; // params[0].value.a: the Keymaster error
+    uint32_t b = 0;    // params[0].value.b
+    uint32_t out_len = 0;
+    bool ok() const { return res == TEE_SUCCESS && error == 0; }
+};
+
+// Thrown when the TA refuses: a benchmark of a failing operation means nothing.
+class TaFailure : public std::runtime_error {
+public:
+    TaFailure(const std::string &what, const Reply &r);
+};
+
+// A fresh TEE with a temporary state directory, silent, with one
+// normal-world session into the Keymaster TA. One per process.
+class TaSession {
+public:
+    TaSession();
+    ~TaSession();
+    TaSession(const TaSession &) = delete;
+    TaSession &operator=(const TaSession &) = delete;
+
+    // invoke - a command taking (value a/b, request, response buffer);
+    // out keeps its size, the reply says how much was written.
+    Reply invoke(uint32_t command, uint32_t a, const Bytes &in, Bytes &out);
+
+    // import_key - the key blob for this material; throws when refused.
+    Bytes import_key(const km::ParamSet &params, const Bytes &material);
+
+private:
+    std::filesystem::path state_dir_;
+    std::unique_ptr<tee_host::Tee> tee_;
+    uint32_t session_ = 0;
+};
+
+// One operation on one key, repeatable: the begin, update and finish
+// requests are serialized once, so run() costs only the commands.
+class TaOperation {
+public:
+    // signature is what finish carries (verification); empty otherwise.
+    TaOperation(TaSession &ta, uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params,
+                const Bytes &input, const Bytes &signature = {}, size_t output_capacity = 4096);
+
+    // run - begin, update until all input is taken, finish. Returns the
+    // update outputs followed by the finish output; throws when refused.
+    const Bytes &run();
+
+private:
+    void update_all(uint32_t handle);
+
+    TaSession &ta_;
+    uint32_t purpose_;
+    Bytes input_;
+    Bytes begin_request_;
+    Bytes update_request_;
+    Bytes finish_request_;
+    Bytes response_;
+    Bytes output_;
+};
+
+} // namespace bench
+
+#endif
