@@ -9,27 +9,7 @@
 
 namespace {
 
-class Objects : public ::testing::Test {
-protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/plat-objects-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-        tee_host::Config config;
-        config.state_dir = dir_;
-        config.trace_level = 0;
-        tee_ = std::make_unique<tee_host::Tee>(config);
-    }
-    void TearDown() override {
-        EXPECT_EQ(tee_host::handles::live_objects(), 0u);
-        EXPECT_EQ(tee_host::handles::live_operations(), 0u);
-        tee_.reset();
-        std::error_code ec;
-        std::filesystem::remove_all(dir_, ec);
-    }
-    std::filesystem::path dir_;
-    std::unique_ptr<tee_host::Tee> tee_;
-};
+class Objects : public TeeTest {};
 
 struct Obj {
     TEE_ObjectHandle h = TEE_HANDLE_NULL;

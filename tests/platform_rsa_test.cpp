@@ -450,29 +450,9 @@ Bytes ossl_raw(EVP_PKEY *k, bool private_op, const Bytes &block) {
     return out;
 }
 
-class Rsa : public ::testing::Test {
+class Rsa : public TeeTest {
 protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/plat-rsa-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-        start();
-    }
-    void TearDown() override {
-        EXPECT_EQ(tee_host::handles::live_operations(), 0u);
-        EXPECT_EQ(tee_host::handles::live_objects(), 0u);
-        tee_.reset();
-        std::error_code ec;
-        std::filesystem::remove_all(dir_, ec);
-    }
-    void start() {
-        tee_host::Config config;
-        config.state_dir = dir_;
-        config.trace_level = 0;
-        tee_ = std::make_unique<tee_host::Tee>(config);
-    }
-    std::filesystem::path dir_;
-    std::unique_ptr<tee_host::Tee> tee_;
+    void start() { restart(); }
 };
 
 // --- Key objects ---------------------------------------------------------------------

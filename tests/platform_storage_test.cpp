@@ -21,28 +21,8 @@ constexpr uint32_t kShareRead = TEE_DATA_FLAG_SHARE_READ;
 constexpr uint32_t kShareWrite = TEE_DATA_FLAG_SHARE_WRITE;
 constexpr uint32_t kAll = kRead | kWrite | kMeta;
 
-class Storage : public ::testing::Test {
+class Storage : public TeeTest {
 protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/plat-storage-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-        restart();
-    }
-    void TearDown() override {
-        EXPECT_EQ(tee_host::handles::live_objects(), 0u);
-        tee_.reset();
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-    // restart - a new Tee on the same state directory.
-    void restart() {
-        tee_.reset();
-        tee_host::Config config;
-        config.state_dir = dir_;
-        config.trace_level = 0;
-        tee_ = std::make_unique<tee_host::Tee>(config);
-    }
     fs::path private_dir() const { return dir_ / "storage" / "private"; }
     std::vector<std::string> files_in(const fs::path &d) const {
         std::vector<std::string> names;
@@ -51,9 +31,6 @@ protected:
         std::sort(names.begin(), names.end());
         return names;
     }
-
-    fs::path dir_;
-    std::unique_ptr<tee_host::Tee> tee_;
 };
 
 const char kId[] = "key-blob";

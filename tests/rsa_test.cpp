@@ -13,6 +13,7 @@
 #include <openssl/x509.h>
 
 #include "key_commands.h"
+#include "km/key_material.h"
 #include "keymaster_defs.h"
 #include "rsa_keys.h"
 #include "ta_entry.h"
@@ -29,21 +30,12 @@ Pkey load_pem(const char *pem) {
     return Pkey(k, EVP_PKEY_free);
 }
 
-// The TA's import material: n, e, d, p, q, dp, dq, qinv as u32 length + big-endian bytes.
-Bytes material_of(EVP_PKEY *k) {
-    const char *names[] = {OSSL_PKEY_PARAM_RSA_N,         OSSL_PKEY_PARAM_RSA_E,         OSSL_PKEY_PARAM_RSA_D,
-                           OSSL_PKEY_PARAM_RSA_FACTOR1,   OSSL_PKEY_PARAM_RSA_FACTOR2,   OSSL_PKEY_PARAM_RSA_EXPONENT1,
-                           OSSL_PKEY_PARAM_RSA_EXPONENT2, OSSL_PKEY_PARAM_RSA_COEFFICIENT1};
-    Bytes out;
-    for (const char *name : names) {
-        BIGNUM *bn = nullptr;
-        EXPECT_EQ(EVP_PKEY_get_bn_param(k, name, &bn), 1) << name;
-        Bytes v(static_cast<size_t>(BN_num_bytes(bn)));
-        BN_bn2bin(bn, v.data());
-        BN_clear_free(bn);
-        km::put_lv(out, v);
-    }
-    return out;
+// The TA's import material, made by the client library from the PEM.
+Bytes material_of(const char *pem) {
+    std::string why;
+    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)), &why);
+    EXPECT_TRUE(m.has_value()) << why;
+    return m.value_or(Bytes{});
 }
 
 // One OpenSSL public- or private-key operation with the given padding settings.
@@ -138,12 +130,11 @@ protected:
         return p;
     }
     Bytes import_pem(const char *pem, ParamSet extra = {}) {
-        Pkey k = load_pem(pem);
         ParamSet p = key_params();
         for (const auto &x : extra.params())
             p.add(x.tag, x.value);
         Bytes blob;
-        EXPECT_TRUE(import(p, material_of(k.get()), &blob).ok()) << dump_log();
+        EXPECT_TRUE(import(p, material_of(pem), &blob).ok()) << dump_log();
         return blob;
     }
     Pkey exported(const Bytes &blob) {
@@ -166,8 +157,7 @@ protected:
 };
 
 TEST_F(Rsa, ImportCompletesTheParametersAndKeepsTheMaterial) {
-    Pkey k = load_pem(kRsa2048Pem);
-    Bytes material = material_of(k.get());
+    Bytes material = material_of(kRsa2048Pem);
     ParamSet p = key_params();
     Bytes blob, chars;
     Bytes with_tail = material;
@@ -424,9 +414,8 @@ TEST_F(Rsa, BeginRefusesPaddingAndDigestCombinations) {
 
     ParamSet soter = key_params();
     soter.add_bool(KM_TAG_SOTER_IS_FROM_SOTER);
-    Pkey k = load_pem(kRsa1024Pem);
     Bytes soter_blob;
-    ASSERT_TRUE(import(soter, material_of(k.get()), &soter_blob).ok());
+    ASSERT_TRUE(import(soter, material_of(kRsa1024Pem), &soter_blob).ok());
     EXPECT_EQ(begin(KM_PURPOSE_SIGN, soter_blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), &h).error,
               KM_ERROR_UNIMPLEMENTED);
 }

@@ -34,6 +34,29 @@ Params Params::io(uint32_t a, uint32_t b, Bytes *in, Bytes *out) {
     return r;
 }
 
+void TeeTest::SetUp() {
+    char tmpl[] = "/tmp/tee-test-XXXXXX";
+    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    dir_ = tmpl;
+    restart();
+}
+
+void TeeTest::restart() {
+    tee_.reset();
+    tee_host::Config config;
+    config.state_dir = dir_;
+    config.trace_level = 0;
+    tee_ = std::make_unique<tee_host::Tee>(config);
+}
+
+void TeeTest::TearDown() {
+    EXPECT_EQ(tee_host::handles::live_operations(), 0u);
+    EXPECT_EQ(tee_host::handles::live_objects(), 0u);
+    tee_.reset();
+    std::error_code ec;
+    std::filesystem::remove_all(dir_, ec);
+}
+
 void TaTest::SetUp() {
     char tmpl[] = "/tmp/km-test-XXXXXX";
     ASSERT_NE(mkdtemp(tmpl), nullptr);

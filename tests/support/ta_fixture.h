@@ -29,6 +29,18 @@ struct Params {
     static Params io(uint32_t a, uint32_t b, Bytes *in, Bytes *out);
 };
 
+// A bare emulated TEE with no TA installed, on a fresh state directory,
+// for tests of the platform's own services. Ends with no live handle.
+class TeeTest : public ::testing::Test {
+protected:
+    void SetUp() override;
+    void TearDown() override;
+    // restart - a new Tee on the same state directory.
+    void restart();
+    std::filesystem::path dir_;
+    std::unique_ptr<tee_host::Tee> tee_;
+};
+
 class TaTest : public ::testing::Test {
 protected:
     void SetUp() override;
