@@ -46,6 +46,21 @@ bool read_request(const uint8_t *in, uint32_t in_len, const uint8_t **data, uint
     return r.read_lv(data, data_len, func) && r.read_lv(params, params_len, func);
 }
 
+// The update and finish parameters: parsed, then the per-operation user
+// authentication checked against them (the handle is the challenge).
+TEE_Result parse_and_authorize(const uint8_t *ser, uint32_t ser_len, keymaster_key_param_set_t *in_params,
+                               const operation_t *op, uint32_t handle, int32_t *error, const char *func) {
+    if (unmarshal(ser, ser_len, in_params) != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unmarshal failed");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return TEE_SUCCESS;
+    }
+    TEE_Result res = authorize_update_or_finish(in_params, op, handle, error);
+    if (res != TEE_SUCCESS || *error)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Authorization failed");
+    return res;
+}
+
 } // namespace
 
 TEE_Result operation_pool_init() {
@@ -232,16 +247,9 @@ TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
             res = TEE_ERROR_GENERIC;
             break;
         }
-        if (unmarshal(ser, ser_len, &in_params) != TEE_SUCCESS) {
-            KM_ERR("Unmarshal failed");
-            *error = KM_ERROR_INVALID_ARGUMENT;
+        res = parse_and_authorize(ser, ser_len, &in_params, op, handle, error, __func__);
+        if (res != TEE_SUCCESS || *error)
             break;
-        }
-        res = authorize_update_or_finish(&in_params, op, handle, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_ERR("Authorization failed");
-            break;
-        }
         if (!op->update) {
             KM_ERR("Update not implemented");
             *error = KM_ERROR_UNIMPLEMENTED;
@@ -286,16 +294,9 @@ TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
             res = TEE_ERROR_GENERIC;
             break;
         }
-        if (unmarshal(ser, ser_len, &in_params) != TEE_SUCCESS) {
-            KM_ERR("Unmarshal failed");
-            *error = KM_ERROR_INVALID_ARGUMENT;
+        res = parse_and_authorize(ser, ser_len, &in_params, op, handle, error, __func__);
+        if (res != TEE_SUCCESS || *error)
             break;
-        }
-        res = authorize_update_or_finish(&in_params, op, handle, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_ERR("Authorization failed");
-            break;
-        }
         if (!op->finish) {
             KM_ERR("Finish not implemented");
             *error = KM_ERROR_UNIMPLEMENTED;

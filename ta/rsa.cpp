@@ -310,7 +310,37 @@ TEE_Result rsa_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_
     return TEE_SUCCESS;
 }
 
-/* ---- signatures ---------------------------------------------------------- */
+/* ---- operations ---------------------------------------------------------- */
+
+namespace {
+
+// The first steps every RSA operation takes: the key object, a buffer of one
+// block (key size / 8 bytes) and the single padding of the begin parameters.
+// False, logged in the caller's name, on failure; what was made stays in the
+// outputs for the record's free.
+bool rsa_operation_start(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                         TEE_ObjectHandle *key, uint32_t *key_size, uint8_t **block, const key_param_t **padding,
+                         int32_t *error, const char *func) {
+    if (rsa_resolve_key_data(key_data, key_data_len, key, key_size, error) != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        return false;
+    }
+    *block = static_cast<uint8_t *>(ta_malloc(*key_size / 8));
+    if (!*block) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return false;
+    }
+    *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
+    if (!*padding) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return false;
+    }
+    return true;
+}
+
+} // namespace
 
 operation_t *rsa_signature_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                   bool signing, int32_t *error, const operation_fns_t *fns, const char *func) {
@@ -324,23 +354,11 @@ operation_t *rsa_signature_create(const uint8_t *key_data, uint32_t key_data_len
     }
     bool ok = false;
     do {
-        if (rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        const key_param_t *padding = nullptr;
+        if (!rsa_operation_start(key_data, key_data_len, in_params, &op->key, &op->key_size, &op->message, &padding,
+                                 error, func))
             break;
-        }
         const uint32_t key_bytes = op->key_size / 8;
-        op->message = static_cast<uint8_t *>(ta_malloc(key_bytes));
-        if (!op->message) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
-        }
-        const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
-        if (!padding) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
         const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
         if (!digest) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
@@ -487,22 +505,10 @@ operation_t *rsa_cipher_create(const uint8_t *key_data, uint32_t key_data_len, k
     }
     bool ok = false;
     do {
-        if (rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        const key_param_t *padding = nullptr;
+        if (!rsa_operation_start(key_data, key_data_len, in_params, &op->key, &op->key_size, &op->input, &padding,
+                                 error, func))
             break;
-        }
-        op->input = static_cast<uint8_t *>(ta_malloc(op->key_size / 8));
-        if (!op->input) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
-        }
-        const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
-        if (!padding) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
         const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
         op->padding = padding->enumerated;
         op->digest = digest ? digest->enumerated : static_cast<uint32_t>(KM_DIGEST_NONE);
