@@ -20,10 +20,16 @@ const algorithm_provider_t *find_algorithm_provider(uint32_t algorithm) {
     return nullptr;
 }
 
-const purpose_ops_t *find_purpose_ops(uint32_t algorithm, uint32_t purpose) {
-    for (const algorithm_provider_t *p : algorithm_providers)
-        if (p && p->algorithm == algorithm && p->get_purpose_ops)
-            return p->get_purpose_ops(purpose);
+const purpose_ops_t *find_purpose_ops(uint32_t algorithm, uint32_t purpose, const algorithm_provider_t **provider) {
+    if (provider)
+        *provider = nullptr;
+    for (const algorithm_provider_t *p : algorithm_providers) {
+        if (!p || p->algorithm != algorithm || !p->get_purpose_ops)
+            continue;
+        if (provider)
+            *provider = p;
+        return p->get_purpose_ops(purpose);
+    }
     return nullptr;
 }
 
@@ -37,7 +43,9 @@ uint32_t unique_value(keymaster_key_param_set_t *in_params, uint32_t tag, uint32
 }
 } // namespace
 
-uint32_t param_getter_none(keymaster_key_param_set_t *, uint32_t *) { return 1; }
+uint32_t param_getter_none(keymaster_key_param_set_t *, uint32_t *) {
+    return 1;
+}
 
 uint32_t param_getter_digest(keymaster_key_param_set_t *in_params, uint32_t *value) {
     return unique_value(in_params, KM_TAG_DIGEST, value);
@@ -68,24 +76,49 @@ TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origi
     return res;
 }
 
-operation_t *operation_record_alloc(uint32_t size, const operation_fns_t *fns) {
-    auto *op = static_cast<operation_t *>(ta_malloc(size));
-    if (!op)
+operation_t *operation_record_alloc(const operation_fns_t *fns, const char *func) {
+    auto *op = static_cast<operation_t *>(ta_malloc(fns->record_size));
+    if (!op) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
         return nullptr;
-    op->free = fns->free;
-    op->update = fns->update;
-    op->finish = fns->finish;
+    }
+    op->fns = fns;
     return op;
 }
 
-TEE_Result provider_settle_key(TEE_Result res, bool done, int32_t *error, heap_buf *buf, uint8_t **key_data,
-                               uint32_t *key_data_len) {
-    if (done && res == TEE_SUCCESS && *error == KM_ERROR_OK) {
-        *key_data_len = buf->len();
-        *key_data = buf->release();
-        return TEE_SUCCESS;
+void operation_destroy(operation_t *op, record_state state) {
+    if (!op) {
+        KM_ERR("Try to free NULL operation_t");
+        return;
     }
-    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
-        *error = KM_ERROR_UNKNOWN_ERROR;
-    return res;
+    key_param_set_release(&op->key_params);
+    const operation_fns_t *fns = op->fns;
+    fns->release(op, state == record_state::complete);
+    ta_free_wiped(op, fns->record_size);
+}
+
+void record_release::missing(bool required) const {
+    if (required && audit_)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func_, __LINE__, "Try to free invalid %s", op_->fns->record_name);
+}
+
+void record_release::object(TEE_ObjectHandle *h, bool required) {
+    if (!*h)
+        return missing(required);
+    TEE_FreeTransientObject(*h);
+    *h = nullptr;
+}
+
+void record_release::operation(TEE_OperationHandle *h, bool required) {
+    if (!*h)
+        return missing(required);
+    TEE_FreeOperation(*h);
+    *h = nullptr;
+}
+
+void record_release::buffer(uint8_t **p, uint32_t len, bool required) {
+    if (!*p)
+        return missing(required);
+    ta_free_wiped(*p, len);
+    *p = nullptr;
 }

@@ -19,23 +19,33 @@ struct auth_token_slot_t {
 TEE_ObjectHandle auth_token_key = nullptr;
 auth_token_slot_t *auth_token_cache = nullptr;
 
-constexpr uint32_t kChallengeOffset = 1;
-constexpr uint32_t kUserIdOffset = 9;
-constexpr uint32_t kAuthenticatorIdOffset = 17;
-constexpr uint32_t kAuthTypeOffset = 25;
-constexpr uint32_t kTimestampOffset = 29;
+// The fields of a token, read in wire order.
+struct auth_token_fields_t {
+    uint8_t version;
+    uint64_t challenge;
+    uint64_t user_id;
+    uint64_t authenticator_id;
+    uint32_t auth_type;
+    uint64_t timestamp;
+};
 
-uint32_t get_u32be(const uint8_t *p) {
-    return uint32_t{p[0]} << 24 | uint32_t{p[1]} << 16 | uint32_t{p[2]} << 8 | uint32_t{p[3]};
+// Parses the 37 authenticated bytes of a token already known to be 69 bytes long.
+auth_token_fields_t parse_token(const uint8_t *token) {
+    auth_token_fields_t f{};
+    byte_reader r(token, kAuthTokenMacOffset);
+    // Cannot run short: 1 + 8 + 8 + 8 + 4 + 8 = 37 bytes.
+    (void)(r.read_u8(&f.version) && r.read_u64(&f.challenge) && r.read_u64(&f.user_id) &&
+           r.read_u64(&f.authenticator_id) && r.read_u32be(&f.auth_type) && r.read_u64be(&f.timestamp));
+    return f;
 }
-uint64_t get_u64be(const uint8_t *p) { return uint64_t{get_u32be(p)} << 32 | get_u32be(p + 4); }
 
 void release_all() {
-    ta_free(use_log);
+    use_log_release();
+    if (auth_token_cache)
+        TEE_MemFill(auth_token_cache, 0, kAuthTokenCacheSlots * sizeof(auth_token_slot_t));
     ta_free(auth_token_cache);
     if (auth_token_key)
         TEE_FreeTransientObject(auth_token_key);
-    use_log = nullptr;
     auth_token_cache = nullptr;
     auth_token_key = nullptr;
 }
@@ -67,58 +77,51 @@ TEE_Result authorizaiton_init() {
         release_all();
         return res;
     }
-    use_log = static_cast<use_log_entry_t *>(ta_malloc(kUseLogEntries * sizeof(use_log_entry_t)));
-    auth_token_cache = use_log ? static_cast<auth_token_slot_t *>(
-                                     ta_malloc(kAuthTokenCacheSlots * sizeof(auth_token_slot_t)))
-                               : nullptr;
-    if (!use_log || !auth_token_cache) {
+    res = use_log_init();
+    auth_token_cache =
+        res == TEE_SUCCESS
+            ? static_cast<auth_token_slot_t *>(ta_malloc(kAuthTokenCacheSlots * sizeof(auth_token_slot_t)))
+            : nullptr;
+    if (!auth_token_cache) {
         KM_ERR("Out of memory");
         release_all();
         return TEE_ERROR_OUT_OF_MEMORY;
     }
     for (uint32_t i = 0; i < kAuthTokenCacheSlots; ++i)
         auth_token_cache[i].free = 1;
-    TEE_GetSystemTime(&system_time_at_init);
-    TEE_GetREETime(&ree_time_at_init);
+    time_anchors_init();
     return TEE_SUCCESS;
 }
 
 void authorization_deinit() {
-    if (auth_token_cache)
-        TEE_MemFill(auth_token_cache, 0, kAuthTokenCacheSlots * sizeof(auth_token_slot_t));
     release_all();
 }
 
-void ComputeSignature(uint8_t *out, uint32_t out_len, TEE_ObjectHandle key, const uint8_t *data, uint32_t data_len) {
+TEE_Result ComputeSignature(uint8_t *out, uint32_t out_len, TEE_ObjectHandle key, const uint8_t *data,
+                            uint32_t data_len) {
     uint8_t mac[256] = {};
     uint32_t mac_len = sizeof mac;
+    scope_exit wipe([&] { TEE_MemFill(mac, 0, sizeof mac); });
     if (out_len != 32) {
         TEE_MemFill(out, 0, out_len);
         KM_ERR("Wrong signature size, expected %dB, got %dB\n", 32, static_cast<int>(out_len));
     }
     operation_guard op;
-    TEE_Result res = TEE_AllocateOperation(op.out(), TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateOperation failed with 0x%08x\n", res);
-        TEE_MemFill(out, 0, out_len);
-        return;
+    TEE_Result res = keyed_operation(op.out(), TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256, key);
+    if (res == TEE_SUCCESS) {
+        TEE_MACInit(op.get(), nullptr, 0);
+        res = TEE_MACComputeFinal(op.get(), data, data_len, mac, &mac_len);
+        if (res != TEE_SUCCESS)
+            KM_ERR("MACComputeFinal failed with 0x%08x\n", res);
     }
-    res = TEE_SetOperationKey(op.get(), key);
     if (res != TEE_SUCCESS) {
-        KM_ERR("SetOperationKey failed with 0x%08x\n", res);
         TEE_MemFill(out, 0, out_len);
-        return;
-    }
-    TEE_MACInit(op.get(), nullptr, 0);
-    res = TEE_MACComputeFinal(op.get(), data, data_len, mac, &mac_len);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("MACComputeFinal failed with 0x%08x\n", res);
-        TEE_MemFill(out, 0, out_len);
-        return;
+        return res;
     }
     if (mac_len != 32)
         KM_ERR("Wrong MAC length, expected %dB, got %dB\n", 32, static_cast<int>(mac_len));
     TEE_MemMove(out, mac, out_len < mac_len ? out_len : mac_len);
+    return TEE_SUCCESS;
 }
 
 uint32_t check_auth_token_valid(const uint8_t *token, uint32_t token_len) {
@@ -132,12 +135,12 @@ uint32_t check_auth_token_valid(const uint8_t *token, uint32_t token_len) {
         return 1;
     }
     uint8_t expected[32] = {};
-    ComputeSignature(expected, sizeof expected, auth_token_key, token, kAuthTokenMacOffset);
-    // Compare every byte: the time taken must not tell how much matched.
-    uint8_t diff = 0;
-    for (uint32_t i = 0; i < sizeof expected; ++i)
-        diff |= static_cast<uint8_t>(expected[i] ^ token[kAuthTokenMacOffset + i]);
-    return diff == 0 ? 0 : 1;
+    // No expected MAC, no valid token: a token must never be checked against zeros.
+    if (ComputeSignature(expected, sizeof expected, auth_token_key, token, kAuthTokenMacOffset) != TEE_SUCCESS) {
+        KM_ERR("Auth token MAC not computed, token refused");
+        return 1;
+    }
+    return bytes_equal_ct(expected, token + kAuthTokenMacOffset, sizeof expected) ? 0 : 1;
 }
 
 void auth_token_cache_add(const uint8_t *token) {
@@ -156,17 +159,17 @@ void auth_token_cache_add(const uint8_t *token) {
 uint32_t check_auth(uint64_t secure_id, uint64_t challenge, const uint8_t *token, const key_param_t *timeout,
                     const key_param_t *auth_type) {
     if (token) {
-        uint32_t type = get_u32be(token + kAuthTypeOffset);
+        const auth_token_fields_t t = parse_token(token);
         auth_token_cache_add(token);
-        if (get_u64le(token + kUserIdOffset) != secure_id && get_u64le(token + kAuthenticatorIdOffset) != secure_id) {
+        if (t.user_id != secure_id && t.authenticator_id != secure_id) {
             KM_ERR("User id mismatch");
             return 1;
         }
-        if ((type & auth_type->enumerated) == 0) {
+        if ((t.auth_type & auth_type->enumerated) == 0) {
             KM_ERR("Auth type mismatch");
             return 1;
         }
-        if (challenge == 0 || get_u64le(token + kChallengeOffset) == challenge)
+        if (challenge == 0 || t.challenge == challenge)
             return 0;
         KM_ERR("Challenge mismatch");
         return 1;
@@ -181,12 +184,11 @@ uint32_t check_auth(uint64_t secure_id, uint64_t challenge, const uint8_t *token
         const auth_token_slot_t &slot = auth_token_cache[i];
         if (slot.free)
             continue;
-        if (get_u64le(slot.token + kUserIdOffset) != secure_id)
-            continue;
-        if ((get_u32be(slot.token + kAuthTypeOffset) & auth_type->enumerated) == 0)
+        const auth_token_fields_t t = parse_token(slot.token);
+        if (t.user_id != secure_id || (t.auth_type & auth_type->enumerated) == 0)
             continue;
         // A token stamped in the future wraps to a huge age and never counts.
-        if (now_ms - get_u64be(slot.token + kTimestampOffset) < window_ms)
+        if (now_ms - t.timestamp < window_ms)
             return 0;
     }
     return 1;

@@ -26,12 +26,13 @@ constexpr hmac_digest_t kDigestTable[] = {
     {KM_DIGEST_SHA_2_224, TEE_TYPE_HMAC_SHA224, 112, 512, 224, TEE_ALG_HMAC_SHA224},
     {KM_DIGEST_SHA_2_256, TEE_TYPE_HMAC_SHA256, 192, 1024, 256, TEE_ALG_HMAC_SHA256},
     {KM_DIGEST_SHA_2_384, TEE_TYPE_HMAC_SHA384, 256, 1024, 384, TEE_ALG_HMAC_SHA384},
-    {KM_DIGEST_SHA_2_512, TEE_TYPE_HMAC_SHA512, 256, 1024, 512, TEE_ALG_HMAC_SHA512},
-};
+    {KM_DIGEST_SHA_2_512, TEE_TYPE_HMAC_SHA512, 256, 1024, 512, TEE_ALG_HMAC_SHA512}};
 
 constexpr uint32_t kKeyDataHeader = 8; // key size and key type words
 
-bool valid_bit_length(uint32_t bits) { return bits >= 64 && bits % 8 == 0; }
+bool valid_bit_length(uint32_t bits) {
+    return bits >= 64 && bits % 8 == 0;
+}
 
 // The minimum MAC length and digest rules shared by generation and import;
 // on success *entry is the digest's row.
@@ -79,8 +80,8 @@ TEE_Result check_mac_length_and_digest(const keymaster_key_param_set_t *params, 
 }
 
 // Starts key data: allocates header + key_bytes and writes the two header words.
-TEE_Result start_key_data(heap_buf *buf, uint32_t key_size, uint32_t key_type, uint32_t key_bytes,
-                          int32_t oom_error, int32_t *error, const char *func) {
+TEE_Result start_key_data(heap_buf *buf, uint32_t key_size, uint32_t key_type, uint32_t key_bytes, int32_t oom_error,
+                          int32_t *error, const char *func) {
     if (!buf->alloc(kKeyDataHeader + key_bytes)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
         if (oom_error != 0) {
@@ -106,12 +107,10 @@ uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
 
 TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                              int32_t *error) {
-    heap_buf buf(true);
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
-    *key_data = nullptr;
-    *key_data_len = 0;
-    *error = KM_ERROR_OK;
 
     do {
         res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
@@ -162,17 +161,15 @@ TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_da
         }
         done = true;
     } while (false);
-    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
+    return out.settle(res, done);
 }
 
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                            uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    heap_buf buf(true);
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
-    *key_data = nullptr;
-    *key_data_len = 0;
-    *error = KM_ERROR_OK;
 
     do {
         res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
@@ -215,7 +212,7 @@ TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *mat
         TEE_MemMove(buf.get() + kKeyDataHeader, material, material_len);
         done = true;
     } while (false);
-    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
+    return out.settle(res, done);
 }
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
@@ -251,14 +248,14 @@ TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len,
 }
 
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
-                                   keymaster_key_param_set_t *out_params, int32_t *error,
-                                   const operation_fns_t *fns, const char *func) {
-    auto *op = reinterpret_cast<hmac_operation_t *>(operation_record_alloc(sizeof(hmac_operation_t), fns));
-    if (!op) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+                                   keymaster_key_param_set_t *out_params, int32_t *error, const operation_fns_t *fns,
+                                   const char *func) {
+    operation_t *header = operation_record_alloc(fns, func);
+    if (!header) {
         key_param_set_release(out_params);
         return nullptr;
     }
+    auto *op = operation_record<hmac_operation_t>(header);
     bool ok = [&] {
         uint32_t key_type = 0;
         TEE_Result res = hmac_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, &key_type, error);
@@ -279,41 +276,28 @@ operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_le
             *error = KM_ERROR_INVALID_KEY_BLOB;
             return false;
         }
-        res = TEE_AllocateOperation(&op->operation, algorithm, TEE_MODE_MAC, op->key_size);
-        if (res != TEE_SUCCESS) {
-            op->operation = nullptr;
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
+        if (keyed_operation(&op->operation, algorithm, TEE_MODE_MAC, op->key_size, op->key, tee_call_texts::standard,
+                            func) != TEE_SUCCESS)
             return false;
-        }
-        res = TEE_SetOperationKey(op->operation, op->key);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "SetOperationKey failed with 0x%08x\n", res);
-            return false;
-        }
         TEE_MACInit(op->operation, nullptr, 0);
         return true;
     }();
     if (ok)
-        return &op->header;
+        return header;
     key_param_set_release(out_params);
-    if (op->key)
-        TEE_FreeTransientObject(op->key);
-    if (op->operation)
-        TEE_FreeOperation(op->operation);
-    ta_free(op);
+    operation_destroy(header, record_state::partial);
     return nullptr;
 }
 
 TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
                                  int32_t *error) {
-    TEE_MACUpdate(reinterpret_cast<hmac_operation_t *>(op)->operation, input, *input_len);
+    TEE_MACUpdate(operation_record<hmac_operation_t>(op)->operation, input, *input_len);
     *output_len = 0;
     *error = KM_ERROR_OK;
     return TEE_SUCCESS;
 }
 
-TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_len, int32_t *error,
-                              const char *func) {
+TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_len, int32_t *error, const char *func) {
     *mac_len = 64;
     TEE_Result res = TEE_MACComputeFinal(op->operation, nullptr, 0, mac, mac_len);
     if (res != TEE_SUCCESS) {
@@ -328,58 +312,27 @@ TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_
     return TEE_SUCCESS;
 }
 
-void hmac_operation_free(operation_t *op, const char *record_name, const char *func) {
-    if (!op) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free NULL %s", record_name);
-        return;
-    }
-    auto *h = reinterpret_cast<hmac_operation_t *>(op);
-    if (h->key)
-        TEE_FreeTransientObject(h->key);
-    else
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
-    if (h->operation)
-        TEE_FreeOperation(h->operation);
-    else
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
-    ta_free(h);
+void hmac_operation_release(operation_t *header, bool audit) {
+    auto *op = operation_record<hmac_operation_t>(header);
+    record_release r(header, audit);
+    r.object(&op->key);
+    r.operation(&op->operation);
 }
 
 namespace {
 
-constexpr uint32_t kDigests[] = {KM_DIGEST_MD5,       KM_DIGEST_SHA1,      KM_DIGEST_SHA_2_224,
-                                 KM_DIGEST_SHA_2_256, KM_DIGEST_SHA_2_384, KM_DIGEST_SHA_2_512};
 constexpr uint32_t kImportFormats[] = {KM_KEY_FORMAT_RAW};
-
-constexpr purpose_ops_t sign_table() {
-    return purpose_ops_t{list_count_none,      list_write_none,      list_count_none, list_write_none,
-                         list_count<kDigests>, list_write<kDigests>, nullptr,         param_getter_none,
-                         param_getter_none,    param_getter_digest};
-}
-
-constexpr purpose_ops_t with_create(purpose_ops_t t, decltype(purpose_ops_t::create_operation) create) {
-    t.create_operation = create;
-    return t;
-}
-
-const purpose_ops_t hmac_sign_ops = with_create(sign_table(), create_hmac_sign);
-const purpose_ops_t hmac_verify_ops = with_create(sign_table(), create_hmac_verify);
-
-const purpose_ops_t *hmac_get_purpose_ops(uint32_t purpose) {
-    switch (purpose) {
-    case KM_PURPOSE_SIGN:
-        return &hmac_sign_ops;
-    case KM_PURPOSE_VERIFY:
-        return &hmac_verify_ops;
-    default:
-        return nullptr;
-    }
-}
+const purpose_ops_t hmac_sign_ops = digest_signing_table(create_hmac_sign);
+const purpose_ops_t hmac_verify_ops = digest_signing_table(create_hmac_verify);
 
 } // namespace
 
-const algorithm_provider_t hmac_provider = {
-    KM_ALGORITHM_HMAC,          "HMAC",          hmac_get_purpose_ops, list_count<kImportFormats>,
-    list_write<kImportFormats>, list_count_none, list_write_none,      hmac_generate_key,
-    hmac_import_key,            export_key_unsupported,
+// The table as the interface lists its slots, in pairs.
+// clang-format off
+const algorithm_provider_t hmac_provider = {.algorithm = KM_ALGORITHM_HMAC, .name = "HMAC",
+    .get_purpose_ops = purposes_of<nullptr, nullptr, &hmac_sign_ops, &hmac_verify_ops>,
+    .import_format_count = list_count<kImportFormats>, .get_import_formats = list_write<kImportFormats>,
+    .export_format_count = list_count_none, .get_export_formats = list_write_none,
+    .generate_key = hmac_generate_key, .import_key = hmac_import_key, .export_key = export_key_unsupported,
 };
+// clang-format on

@@ -14,7 +14,7 @@ TEE_Result hmac_sign_update(operation_t *op, keymaster_key_param_set_t *, const 
 
 TEE_Result hmac_sign_finish(operation_t *op, keymaster_key_param_set_t *, const uint8_t *, uint32_t, uint8_t **output,
                             uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
-    auto *h = reinterpret_cast<hmac_sign_operation_t *>(op);
+    auto *h = operation_record<hmac_sign_operation_t>(op);
     uint8_t mac[64] = {};
     uint32_t mac_len = 0;
     *output = nullptr;
@@ -37,9 +37,8 @@ TEE_Result hmac_sign_finish(operation_t *op, keymaster_key_param_set_t *, const 
     return TEE_SUCCESS;
 }
 
-void hmac_sign_free(operation_t *op) { hmac_operation_free(op, "hmac_sign_operation_t", __func__); }
-
-const operation_fns_t kSignFns = {hmac_sign_free, hmac_sign_update, hmac_sign_finish, "hmac_sign_operation_t"};
+const operation_fns_t kSignFns = operation_fns<hmac_sign_operation_t>("hmac_sign_operation_t", hmac_sign_update,
+                                                                      hmac_sign_finish, hmac_operation_release);
 
 } // namespace
 

@@ -3,12 +3,13 @@
  * leftmost bytes of the MAC of all input.
  */
 #include "hmac.h"
+#include "byte_io.h"
 #include "ta_log.h"
 
 namespace {
 
-TEE_Result hmac_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input,
-                              uint32_t *input_len, uint8_t *, uint32_t *output_len, int32_t *error) {
+TEE_Result hmac_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
+                              uint8_t *, uint32_t *output_len, int32_t *error) {
     return hmac_operation_update(op, input, input_len, output_len, error);
 }
 
@@ -18,7 +19,7 @@ TEE_Result hmac_verify_update(operation_t *op, keymaster_key_param_set_t *, cons
 TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, const uint8_t *signature,
                               uint32_t signature_len, uint8_t **output, uint32_t *output_len,
                               keymaster_key_param_set_t *, int32_t *error) {
-    auto *h = reinterpret_cast<hmac_verify_operation_t *>(op);
+    auto *h = operation_record<hmac_verify_operation_t>(op);
     uint8_t mac[64] = {};
     uint32_t mac_len = 0;
     *output = nullptr;
@@ -27,11 +28,10 @@ TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, cons
     if (res != TEE_SUCCESS || *error)
         return res;
     const uint32_t want = h->mac_length / 8;
-    uint8_t diff = signature_len == want ? 0 : 1;
-    for (uint32_t i = 0; i < want && i < signature_len; ++i)
-        diff |= static_cast<uint8_t>(mac[i] ^ signature[i]);
+    // The length is no secret; only equal lengths are compared, in constant time.
+    const bool same = signature_len == want && bytes_equal_ct(mac, signature, want);
     TEE_MemFill(mac, 0, sizeof mac);
-    if (diff != 0) {
+    if (!same) {
         KM_ERR("Signature mismatch");
         *error = KM_ERROR_VERIFICATION_FAILED;
         return TEE_SUCCESS;
@@ -40,10 +40,8 @@ TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, cons
     return TEE_SUCCESS;
 }
 
-void hmac_verify_free(operation_t *op) { hmac_operation_free(op, "hmac_verify_operation_t", __func__); }
-
-const operation_fns_t kVerifyFns = {hmac_verify_free, hmac_verify_update, hmac_verify_finish,
-                                         "hmac_verify_operation_t"};
+const operation_fns_t kVerifyFns = operation_fns<hmac_verify_operation_t>("hmac_verify_operation_t", hmac_verify_update,
+                                                                          hmac_verify_finish, hmac_operation_release);
 
 } // namespace
 

@@ -14,12 +14,6 @@
 
 namespace {
 
-// A failure that set neither a result nor an error is still a failure.
-void settle(TEE_Result res, bool done, int32_t *error) {
-    if (!done && res == TEE_SUCCESS && *error == KM_ERROR_OK)
-        *error = KM_ERROR_UNKNOWN_ERROR;
-}
-
 bool blob_usage_repeated(const keymaster_key_param_set_t *params, const char *func = __builtin_FUNCTION()) {
     if (key_param_set_at_most_one(params, KM_TAG_BLOB_USAGE_REQUIREMENTS))
         return false;
@@ -35,8 +29,8 @@ struct opened_key {
 };
 
 // Reads a key reference, opens the blob and checks the application binding.
-TEE_Result open_key_reference(const uint8_t *in, uint32_t in_len, bool check_blob_size, opened_key *key,
-                              int32_t *error, const char *func) {
+TEE_Result open_key_reference(const uint8_t *in, uint32_t in_len, bool check_blob_size, opened_key *key, int32_t *error,
+                              const char *func) {
     byte_reader r(in, in_len);
     const uint8_t *blob = nullptr;
     const uint8_t *app_id = nullptr;
@@ -67,45 +61,65 @@ TEE_Result open_key_reference(const uint8_t *in, uint32_t in_len, bool check_blo
     return TEE_SUCCESS;
 }
 
+// A generate or import request: its parameters and the key data made for them.
+struct key_request_t {
+    keymaster_key_param_set_t params{};
+    param_set_guard params_guard{&params};
+    heap_buf key_data{true};
+};
+
+// The request's provider makes the key data (importing: from material),
+// then the completed set is checked for a repeated blob-usage tag.
+TEE_Result make_key_data(keymaster_key_param_set_t *params, bool importing, const uint8_t *material,
+                         uint32_t material_len, heap_buf *key_data, int32_t *error, const char *func) {
+    const key_param_t *alg = key_param_set_find_unique(params, KM_TAG_ALGORITHM);
+    if (!alg) {
+        if (importing)
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_ALGORITHM");
+        else
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No KM_TAG_ALGORITHM or many KM_TAG_ALGORITHM");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return TEE_SUCCESS;
+    }
+    const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
+    if (!provider || !(importing ? provider->import_key != nullptr : provider->generate_key != nullptr)) {
+        if (importing)
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupport import_key for algorithm %s (%d)",
+                        provider ? provider->name : "", static_cast<int>(alg->enumerated));
+        *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
+        return TEE_SUCCESS;
+    }
+    uint8_t *data = nullptr;
+    uint32_t data_len = 0;
+    TEE_Result res = importing ? provider->import_key(params, material, material_len, &data, &data_len, error)
+                               : provider->generate_key(params, &data, &data_len, error);
+    key_data->adopt(data, data_len);
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK && blob_usage_repeated(params, func))
+        *error = KM_ERROR_INVALID_TAG;
+    return res;
+}
+
 } // namespace
 
 TEE_Result generate_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
-    keymaster_key_param_set_t params{};
-    param_set_guard params_guard(&params);
-    heap_buf key_data(true);
+    key_request_t req;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
+    // save_key rewrites *out_len: the wipe on failure must cover what the caller gave.
+    const uint32_t capacity = *out_len;
     *error = KM_ERROR_OK;
 
     do {
-        if (unmarshal(in, in_len, &params) != TEE_SUCCESS) {
+        if (unmarshal(in, in_len, &req.params) != TEE_SUCCESS) {
             KM_ERR("Unmarshal failed");
             res = TEE_ERROR_BAD_PARAMETERS;
             break;
         }
-        KM_DUMP_PARAM_SET(&params);
-        const key_param_t *alg = key_param_set_find_unique(&params, KM_TAG_ALGORITHM);
-        if (!alg) {
-            KM_ERR("No KM_TAG_ALGORITHM or many KM_TAG_ALGORITHM");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
-        if (!provider || !provider->generate_key) {
-            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
-            break;
-        }
-        uint8_t *data = nullptr;
-        uint32_t data_len = 0;
-        res = provider->generate_key(&params, &data, &data_len, error);
-        key_data.adopt(data, data_len);
+        KM_DUMP_PARAM_SET(&req.params);
+        res = make_key_data(&req.params, false, nullptr, 0, &req.key_data, error, __func__);
         if (res != TEE_SUCCESS || *error)
             break;
-        if (blob_usage_repeated(&params)) {
-            *error = KM_ERROR_INVALID_TAG;
-            break;
-        }
-        res = save_key(key_data.get(), key_data.len(), &params, out, out_len);
+        res = save_key(req.key_data.get(), req.key_data.len(), &req.params, out, out_len);
         if (res != TEE_SUCCESS) {
             KM_ERR("Can't save key to TEE storage");
             break;
@@ -113,17 +127,15 @@ TEE_Result generate_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32
         done = true;
     } while (false);
     if (!done) {
-        TEE_MemFill(out, 0, *out_len);
+        TEE_MemFill(out, 0, capacity);
         *out_len = 0;
     }
-    settle(res, done, error);
+    settle_error(res, done, error);
     return res;
 }
 
 TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
-    keymaster_key_param_set_t params{};
-    param_set_guard params_guard(&params);
-    heap_buf key_data(true);
+    key_request_t req;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
     const uint32_t capacity = *out_len;
@@ -137,35 +149,16 @@ TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t
             res = TEE_ERROR_GENERIC;
             break;
         }
-        if (unmarshal(ser, ser_len, &params) != TEE_SUCCESS) {
+        if (unmarshal(ser, ser_len, &req.params) != TEE_SUCCESS) {
             KM_ERR("Unmarshal failed");
             res = TEE_ERROR_BAD_PARAMETERS;
             break;
         }
-        KM_DUMP_PARAM_SET(&params);
-        const key_param_t *alg = key_param_set_find_unique(&params, KM_TAG_ALGORITHM);
-        if (!alg) {
-            KM_ERR("No or too many KM_TAG_ALGORITHM");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
-        if (!provider || !provider->import_key) {
-            KM_ERR("Unsupport import_key for algorithm %s (%d)", provider ? provider->name : "",
-                   static_cast<int>(alg->enumerated));
-            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
-            break;
-        }
-        uint8_t *data = nullptr;
-        uint32_t data_len = 0;
-        res = provider->import_key(&params, r.pos(), r.remaining(), &data, &data_len, error);
-        key_data.adopt(data, data_len);
+        KM_DUMP_PARAM_SET(&req.params);
+        // The material is every byte after the parameters.
+        res = make_key_data(&req.params, true, r.pos(), r.remaining(), &req.key_data, error, __func__);
         if (res != TEE_SUCCESS || *error)
             break;
-        if (blob_usage_repeated(&params)) {
-            *error = KM_ERROR_INVALID_TAG;
-            break;
-        }
 
         byte_writer w(out, capacity);
         uint8_t *blob_len_at = nullptr;
@@ -174,32 +167,27 @@ TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t
             break;
         }
         uint32_t blob_len = w.remaining();
-        res = save_key(key_data.get(), key_data.len(), &params, w.pos(), &blob_len);
+        res = save_key(req.key_data.get(), req.key_data.len(), &req.params, w.pos(), &blob_len);
         if (res != TEE_SUCCESS) {
             KM_ERR("Can't save key to TEE storage");
             break;
         }
         put_u32le(blob_len_at, blob_len);
         uint8_t *blob_at = nullptr;
-        uint8_t *chars_len_at = nullptr;
-        if (!w.reserve(blob_len, &blob_at) || !w.reserve(4, &chars_len_at)) {
+        uint32_t chars_len = 0;
+        if (!w.reserve(blob_len, &blob_at)) {
             res = TEE_ERROR_GENERIC;
             break;
         }
-        uint8_t *chars = w.pos();
-        uint32_t chars_len = w.remaining();
-        res = marshal(&params, false, &chars, &chars_len);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("Marshal failed");
+        res = marshal_lv(&w, &req.params, &chars_len);
+        if (res != TEE_SUCCESS)
             break;
-        }
-        put_u32le(chars_len_at, chars_len);
         *out_len = 8 + blob_len + chars_len;
         done = true;
     } while (false);
     if (!done)
         TEE_MemFill(out, 0, capacity);
-    settle(res, done, error);
+    settle_error(res, done, error);
     return res;
 }
 
@@ -258,7 +246,7 @@ TEE_Result export_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t
         }
         done = true;
     } while (false);
-    settle(res, done, error);
+    settle_error(res, done, error);
     return res;
 }
 

@@ -5,7 +5,7 @@
 
 #include "ta_log.h"
 
-void _keymaster_dump_key_param_set(const char *file, int line, const keymaster_key_param_set_t *set) {
+void keymaster_dump_key_param_set(const char *file, int line, const keymaster_key_param_set_t *set) {
     KM_DEBUG("Dump at %s:%d", file, line);
     if (!set || !set->params)
         return;

@@ -93,6 +93,25 @@ fail:
     return res == TEE_SUCCESS ? TEE_ERROR_GENERIC : res;
 }
 
+TEE_Result marshal_lv(byte_writer *w, const keymaster_key_param_set_t *set, uint32_t *written, const char *func) {
+    uint8_t *len_at = nullptr;
+    if (!w->reserve(4, &len_at, func))
+        return TEE_ERROR_GENERIC;
+    uint8_t *at = w->pos();
+    uint32_t len = w->remaining();
+    TEE_Result res = marshal(set, false, &at, &len);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Marshal failed");
+        return res;
+    }
+    put_u32le(len_at, len);
+    uint8_t *skipped = nullptr;
+    w->reserve(len, &skipped, func);
+    if (written)
+        *written = len;
+    return TEE_SUCCESS;
+}
+
 TEE_Result unmarshal(const uint8_t *in, uint32_t in_len, keymaster_key_param_set_t *set) {
     TEE_Result res = TEE_ERROR_GENERIC;
     byte_reader r(in, in_len);

@@ -26,39 +26,42 @@ bool handle_taken(uint32_t handle) {
     return false;
 }
 
-// Ends an operation: its key parameters, its own resources, its slot.
+// Ends an operation: the record with everything it holds, then its slot.
 void end_operation(operation_t *op, uint32_t handle) {
-    key_param_set_release(&op->key_params);
-    if (op->free)
-        op->free(op);
+    operation_destroy(op);
     operation_pool_remove(handle);
 }
 
-void settle(TEE_Result res, bool done, int32_t *error) {
-    if (!done && res == TEE_SUCCESS && *error == KM_ERROR_OK)
-        *error = KM_ERROR_UNKNOWN_ERROR;
-}
-
 // Reads (u32 length, data, u32 length, serialized parameters) and parses the parameters.
-bool read_request(const uint8_t *in, uint32_t in_len, const uint8_t **data, uint32_t *data_len,
-                  const uint8_t **params, uint32_t *params_len, const char *func) {
+bool read_request(const uint8_t *in, uint32_t in_len, const uint8_t **data, uint32_t *data_len, const uint8_t **params,
+                  uint32_t *params_len, const char *func) {
     byte_reader r(in, in_len);
     return r.read_lv(data, data_len, func) && r.read_lv(params, params_len, func);
 }
 
-// The update and finish parameters: parsed, then the per-operation user
-// authentication checked against them (the handle is the challenge).
-TEE_Result parse_and_authorize(const uint8_t *ser, uint32_t ser_len, keymaster_key_param_set_t *in_params,
-                               const operation_t *op, uint32_t handle, int32_t *error, const char *func) {
+// Steps 3 to 5 of update and finish: the parameters parsed, the
+// per-operation user authentication checked against them (the handle is
+// the challenge), and the record's function for the step present. False,
+// with *res or *error set, when the step stops here.
+bool step_ready(const uint8_t *ser, uint32_t ser_len, keymaster_key_param_set_t *in_params, const operation_t *op,
+                uint32_t handle, bool has_step, const char *missing, TEE_Result *res, int32_t *error,
+                const char *func) {
     if (unmarshal(ser, ser_len, in_params) != TEE_SUCCESS) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unmarshal failed");
         *error = KM_ERROR_INVALID_ARGUMENT;
-        return TEE_SUCCESS;
+        return false;
     }
-    TEE_Result res = authorize_update_or_finish(in_params, op, handle, error);
-    if (res != TEE_SUCCESS || *error)
+    *res = authorize_update_or_finish(in_params, op, handle, error);
+    if (*res != TEE_SUCCESS || *error) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Authorization failed");
-    return res;
+        return false;
+    }
+    if (!has_step) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "%s", missing);
+        *error = KM_ERROR_UNIMPLEMENTED;
+        return false;
+    }
+    return true;
 }
 
 } // namespace
@@ -118,15 +121,91 @@ void operation_pool_end_all() {
             end_operation(s.operation, s.handle);
 }
 
-TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
-                 int32_t *error, uint32_t *handle) {
+namespace {
+
+// The begin request opened: its parameters, the key's data and its characteristics.
+struct begin_request_t {
+    const uint8_t *blob = nullptr;
+    uint32_t blob_len = 0;
     keymaster_key_param_set_t in_params{};
-    keymaster_key_param_set_t out_params{};
     keymaster_key_param_set_t key_params{};
-    param_set_guard in_guard(&in_params);
+    param_set_guard in_guard{&in_params};
+    param_set_guard key_guard{&key_params};
+    heap_buf key_data{true};
+};
+
+// Steps 2 to 5: read and parse the request, open the blob, check the application binding.
+TEE_Result begin_open(const uint8_t *in, uint32_t in_len, begin_request_t *r, int32_t *error) {
+    const uint8_t *ser = nullptr;
+    uint32_t ser_len = 0;
+    if (!read_request(in, in_len, &r->blob, &r->blob_len, &ser, &ser_len, "begin"))
+        return TEE_ERROR_GENERIC;
+    if (unmarshal(ser, ser_len, &r->in_params) != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Unmarshal failed");
+        return TEE_ERROR_BAD_PARAMETERS;
+    }
+    KM_DUMP_PARAM_SET(&r->in_params);
+    uint8_t *data = nullptr;
+    uint32_t data_len = 0;
+    TEE_Result res = open_key(r->blob, r->blob_len, &data, &data_len, &r->key_params, error);
+    if (res != TEE_SUCCESS || *error) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Open key failed");
+        return res;
+    }
+    r->key_data.adopt(data, data_len);
+    const key_param_t *app_id = key_param_set_find_unique(&r->in_params, KM_TAG_APPLICATION_ID);
+    const key_param_t *app_data = key_param_set_find_unique(&r->in_params, KM_TAG_APPLICATION_DATA);
+    if (check_app_id_and_app_data(&r->key_params, app_id ? app_id->blob.data : nullptr,
+                                  app_id ? app_id->blob.data_length : 0, app_data ? app_data->blob.data : nullptr,
+                                  app_data ? app_data->blob.data_length : 0) != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Wrong AppId or AppData");
+        *error = KM_ERROR_INVALID_KEY_BLOB;
+    }
+    return TEE_SUCCESS;
+}
+
+// Steps 7 to 10: the provider's purpose table, then its record. Null when
+// refused; *error keeps what the provider set (or the deferred outcome).
+operation_t *begin_create(uint32_t purpose, begin_request_t *r, keymaster_key_param_set_t *out_params, int32_t *error) {
+    const key_param_t *alg = key_param_set_find_unique(&r->key_params, KM_TAG_ALGORITHM);
+    if (!alg) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "No KM_TAG_ALGORITHM");
+        *error = KM_ERROR_UNKNOWN_ERROR;
+        return nullptr;
+    }
+    const algorithm_provider_t *provider = nullptr;
+    const purpose_ops_t *ops = find_purpose_ops(alg->enumerated, purpose, &provider);
+    if (!provider) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Algorithm %d not implemented",
+                    static_cast<int>(alg->enumerated));
+        *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
+        return nullptr;
+    }
+    if (!ops || !ops->create_operation) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Algorithm %s purpose %d not implemented", provider->name,
+                    static_cast<int>(purpose));
+        *error = KM_ERROR_UNSUPPORTED_PURPOSE;
+        return nullptr;
+    }
+    operation_t *op =
+        ops->create_operation(r->key_data.get(), r->key_data.len(), &r->key_params, &r->in_params, out_params, error);
+    if (!op) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "begin", __LINE__, "Create operation failed");
+        return nullptr;
+    }
+    // The record owns the key's parameters from here on.
+    op->key_params = r->key_params;
+    r->key_params = keymaster_key_param_set_t{};
+    return op;
+}
+
+} // namespace
+
+TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
+                 uint32_t *handle) {
+    begin_request_t request;
+    keymaster_key_param_set_t out_params{};
     param_set_guard out_guard(&out_params);
-    param_set_guard key_guard(&key_params);
-    heap_buf key_data(true);
     operation_t *op = nullptr;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
@@ -134,69 +213,19 @@ TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *
     *error = KM_ERROR_OK;
 
     do {
-        const uint8_t *blob = nullptr;
-        const uint8_t *ser = nullptr;
-        uint32_t blob_len = 0;
-        uint32_t ser_len = 0;
-        if (!read_request(in, in_len, &blob, &blob_len, &ser, &ser_len, __func__)) {
-            res = TEE_ERROR_GENERIC;
+        res = begin_open(in, in_len, &request, error);
+        if (res != TEE_SUCCESS || *error)
             break;
-        }
-        if (unmarshal(ser, ser_len, &in_params) != TEE_SUCCESS) {
-            KM_ERR("Unmarshal failed");
-            res = TEE_ERROR_BAD_PARAMETERS;
-            break;
-        }
-        KM_DUMP_PARAM_SET(&in_params);
-        uint8_t *data = nullptr;
-        uint32_t data_len = 0;
-        res = open_key(blob, blob_len, &data, &data_len, &key_params, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_ERR("Open key failed");
-            break;
-        }
-        key_data.adopt(data, data_len);
-        const key_param_t *app_id = key_param_set_find_unique(&in_params, KM_TAG_APPLICATION_ID);
-        const key_param_t *app_data = key_param_set_find_unique(&in_params, KM_TAG_APPLICATION_DATA);
-        if (check_app_id_and_app_data(&key_params, app_id ? app_id->blob.data : nullptr,
-                                      app_id ? app_id->blob.data_length : 0, app_data ? app_data->blob.data : nullptr,
-                                      app_data ? app_data->blob.data_length : 0) != 0) {
-            KM_ERR("Wrong AppId or AppData");
-            *error = KM_ERROR_INVALID_KEY_BLOB;
-            break;
-        }
-        res = authorize_begin(blob, blob_len, purpose, &in_params, &key_params, error);
+        res = authorize_begin(request.blob, request.blob_len, purpose, &request.in_params, &request.key_params, error);
+        // The deferred-authentication outcome goes ahead and stays in *error
+        // until the pool takes the operation.
         if (res != TEE_SUCCESS || (*error != KM_ERROR_OK && *error != KM_OP_AUTH_NEEDED)) {
             KM_ERR("Authorization failed");
             break;
         }
-        *error = KM_ERROR_OK;
-        const key_param_t *alg = key_param_set_find_unique(&key_params, KM_TAG_ALGORITHM);
-        if (!alg) {
-            KM_ERR("No KM_TAG_ALGORITHM");
-            *error = KM_ERROR_UNKNOWN_ERROR;
+        op = begin_create(purpose, &request, &out_params, error);
+        if (!op)
             break;
-        }
-        const algorithm_provider_t *provider = find_algorithm_provider(alg->enumerated);
-        if (!provider || !provider->get_purpose_ops) {
-            KM_ERR("Algorithm %d not implemented", static_cast<int>(alg->enumerated));
-            *error = KM_ERROR_UNSUPPORTED_ALGORITHM;
-            break;
-        }
-        const purpose_ops_t *ops = provider->get_purpose_ops(purpose);
-        if (!ops || !ops->create_operation) {
-            KM_ERR("Algorithm %s purpose %d not implemented", provider->name, static_cast<int>(purpose));
-            *error = KM_ERROR_UNSUPPORTED_PURPOSE;
-            break;
-        }
-        op = ops->create_operation(key_data.get(), key_data.len(), &key_params, &in_params, &out_params, error);
-        if (!op) {
-            KM_ERR("Create operation failed");
-            break;
-        }
-        // The record owns the key's parameters from here on.
-        op->key_params = key_params;
-        key_params = keymaster_key_param_set_t{};
         res = operation_pool_add(op, handle, error);
         if (res != TEE_SUCCESS || *error) {
             KM_ERR("Allocate in operation pool failed");
@@ -212,16 +241,16 @@ TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *
     if (!done && op) {
         if (*handle != 0)
             operation_pool_remove(*handle);
-        key_param_set_release(&op->key_params);
-        if (op->free)
-            op->free(op);
+        operation_destroy(op);
     }
-    settle(res, done, error);
+    if (done)
+        *error = KM_ERROR_OK;
+    settle_error(res, done, error);
     return res;
 }
 
-TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
-                  int32_t *error, uint32_t *consumed) {
+TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
+                  uint32_t *consumed) {
     keymaster_key_param_set_t in_params{};
     param_set_guard in_guard(&in_params);
     bool done = false;
@@ -247,15 +276,10 @@ TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
             res = TEE_ERROR_GENERIC;
             break;
         }
-        res = parse_and_authorize(ser, ser_len, &in_params, op, handle, error, __func__);
-        if (res != TEE_SUCCESS || *error)
+        if (!step_ready(ser, ser_len, &in_params, op, handle, op->fns->update, "Update not implemented", &res, error,
+                        __func__))
             break;
-        if (!op->update) {
-            KM_ERR("Update not implemented");
-            *error = KM_ERROR_UNIMPLEMENTED;
-            break;
-        }
-        res = op->update(op, &in_params, data, consumed, out, out_len, error);
+        res = op->fns->update(op, &in_params, data, consumed, out, out_len, error);
         if (res != TEE_SUCCESS || *error) {
             KM_ERR("Update failed");
             break;
@@ -264,7 +288,7 @@ TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
     } while (false);
     if (!done)
         end_operation(op, handle);
-    settle(res, done, error);
+    settle_error(res, done, error);
     return res;
 }
 
@@ -294,17 +318,12 @@ TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
             res = TEE_ERROR_GENERIC;
             break;
         }
-        res = parse_and_authorize(ser, ser_len, &in_params, op, handle, error, __func__);
-        if (res != TEE_SUCCESS || *error)
+        if (!step_ready(ser, ser_len, &in_params, op, handle, op->fns->finish, "Finish not implemented", &res, error,
+                        __func__))
             break;
-        if (!op->finish) {
-            KM_ERR("Finish not implemented");
-            *error = KM_ERROR_UNIMPLEMENTED;
-            break;
-        }
         uint8_t *result = nullptr;
         uint32_t result_len = 0;
-        res = op->finish(op, &in_params, signature, signature_len, &result, &result_len, &out_params, error);
+        res = op->fns->finish(op, &in_params, signature, signature_len, &result, &result_len, &out_params, error);
         output.adopt(result, result_len);
         if (res != TEE_SUCCESS || *error) {
             KM_ERR("Finish failed");
@@ -314,29 +333,24 @@ TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *
         ended = true;
 
         byte_writer w(out, capacity);
-        uint8_t *params_len_at = nullptr;
-        if (!w.write_u32(output.len()) || !w.write_bytes(output.get(), output.len()) || !w.reserve(4, &params_len_at)) {
+        uint32_t params_len = 0;
+        if (!w.write_u32(output.len()) || !w.write_bytes(output.get(), output.len())) {
             res = TEE_ERROR_GENERIC;
             break;
         }
-        uint8_t *params_at = w.pos();
-        uint32_t params_len = w.remaining();
-        res = marshal(&out_params, false, &params_at, &params_len);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("Marshal failed");
+        res = marshal_lv(&w, &out_params, &params_len);
+        if (res != TEE_SUCCESS)
             break;
-        }
-        put_u32le(params_len_at, params_len);
         *out_len = 8 + output.len() + params_len;
         done = true;
     } while (false);
     if (!ended)
         end_operation(op, handle);
-    settle(res, done, error);
+    settle_error(res, done, error);
     return res;
 }
 
-TEE_Result _abort(uint32_t handle, int32_t *error) {
+TEE_Result abort_operation(uint32_t handle, int32_t *error) {
     operation_t *op = operation_pool_get(handle);
     if (!op) {
         *error = KM_ERROR_INVALID_OPERATION_HANDLE;

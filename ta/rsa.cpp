@@ -13,8 +13,7 @@ namespace {
 
 constexpr uint32_t kAttributeIds[kRsaComponents] = {
     TEE_ATTR_RSA_MODULUS, TEE_ATTR_RSA_PUBLIC_EXPONENT, TEE_ATTR_RSA_PRIVATE_EXPONENT, TEE_ATTR_RSA_PRIME1,
-    TEE_ATTR_RSA_PRIME2,  TEE_ATTR_RSA_EXPONENT1,       TEE_ATTR_RSA_EXPONENT2,        TEE_ATTR_RSA_COEFFICIENT,
-};
+    TEE_ATTR_RSA_PRIME2,  TEE_ATTR_RSA_EXPONENT1,       TEE_ATTR_RSA_EXPONENT2,        TEE_ATTR_RSA_COEFFICIENT};
 
 struct components_t {
     const uint8_t *data[kRsaComponents];
@@ -29,11 +28,8 @@ bool read_components(byte_reader *r, components_t *c, const char *func) {
     return true;
 }
 
-bool valid_key_size(uint32_t bits) { return bits % 8 == 0 && bits <= kRsaMaxKeyBits; }
-
-void put_u64be(uint8_t *p, uint64_t v) {
-    for (int i = 0; i < 8; ++i)
-        p[i] = static_cast<uint8_t>(v >> (8 * (7 - i)));
+bool valid_key_size(uint32_t bits) {
+    return bits % 8 == 0 && bits <= kRsaMaxKeyBits;
 }
 
 struct digest_row_t {
@@ -45,19 +41,17 @@ struct digest_row_t {
     uint32_t oaep; // 0: not offered
 };
 
-constexpr digest_row_t kDigests[] = {
-    {KM_DIGEST_MD5, 16, TEE_ALG_MD5, TEE_ALG_RSASSA_PKCS1_V1_5_MD5, 0, 0},
-    {KM_DIGEST_SHA1, 20, TEE_ALG_SHA1, TEE_ALG_RSASSA_PKCS1_V1_5_SHA1, TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA1,
-     TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA1_EXT},
-    {KM_DIGEST_SHA_2_224, 28, TEE_ALG_SHA224, TEE_ALG_RSASSA_PKCS1_V1_5_SHA224, TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA224,
-     TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA224_EXT},
-    {KM_DIGEST_SHA_2_256, 32, TEE_ALG_SHA256, TEE_ALG_RSASSA_PKCS1_V1_5_SHA256, TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA256,
-     TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA256_EXT},
-    {KM_DIGEST_SHA_2_384, 48, TEE_ALG_SHA384, TEE_ALG_RSASSA_PKCS1_V1_5_SHA384, TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA384,
-     TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA384_EXT},
-    {KM_DIGEST_SHA_2_512, 64, TEE_ALG_SHA512, TEE_ALG_RSASSA_PKCS1_V1_5_SHA512, TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA512,
-     TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA512_EXT},
-};
+constexpr digest_row_t kDigests[] = {{KM_DIGEST_MD5, 16, TEE_ALG_MD5, TEE_ALG_RSASSA_PKCS1_V1_5_MD5, 0, 0},
+                                     {KM_DIGEST_SHA1, 20, TEE_ALG_SHA1, TEE_ALG_RSASSA_PKCS1_V1_5_SHA1,
+                                      TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA1, TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA1_EXT},
+                                     {KM_DIGEST_SHA_2_224, 28, TEE_ALG_SHA224, TEE_ALG_RSASSA_PKCS1_V1_5_SHA224,
+                                      TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA224, TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA224_EXT},
+                                     {KM_DIGEST_SHA_2_256, 32, TEE_ALG_SHA256, TEE_ALG_RSASSA_PKCS1_V1_5_SHA256,
+                                      TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA256, TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA256_EXT},
+                                     {KM_DIGEST_SHA_2_384, 48, TEE_ALG_SHA384, TEE_ALG_RSASSA_PKCS1_V1_5_SHA384,
+                                      TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA384, TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA384_EXT},
+                                     {KM_DIGEST_SHA_2_512, 64, TEE_ALG_SHA512, TEE_ALG_RSASSA_PKCS1_V1_5_SHA512,
+                                      TEE_ALG_RSASSA_PKCS1_PSS_MGF1_SHA512, TEE_ALG_RSAES_PKCS1_OAEP_MGF1_SHA512_EXT}};
 
 const digest_row_t *digest_row(uint32_t digest) {
     for (const digest_row_t &r : kDigests)
@@ -73,115 +67,144 @@ uint32_t rsa_digest_length(uint32_t digest) {
     return r ? r->length : 0;
 }
 
+namespace {
+
+// The generation parameters: a single public exponent and a supported key size.
+bool generation_params(const keymaster_key_param_set_t *params, uint64_t *exponent, uint32_t *key_size,
+                       int32_t *error) {
+    const key_param_t *e = key_param_set_find_unique(params, KM_TAG_RSA_PUBLIC_EXPONENT);
+    if (!e) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__,
+                    "No or too many KM_TAG_RSA_PUBLIC_EXPONENT specified");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return false;
+    }
+    const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+    if (!size) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "No or too many KM_TAG_KEY_SIZE or specified");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return false;
+    }
+    if (!valid_key_size(size->integer)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Invalid RSA key size %d",
+                    static_cast<int>(size->integer));
+        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+        return false;
+    }
+    *exponent = e->long_integer;
+    *key_size = size->integer;
+    return true;
+}
+
+// A fresh key pair of key_size bits with that public exponent.
+TEE_Result generate_pair(uint32_t key_size, uint64_t exponent, object_guard *obj) {
+    uint8_t e[8] = {};
+    put_u64be(e, exponent);
+    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_RSA_KEYPAIR, key_size, obj->out());
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    TEE_Attribute attr{};
+    TEE_InitRefAttribute(&attr, TEE_ATTR_RSA_PUBLIC_EXPONENT, e, sizeof e);
+    res = TEE_GenerateKey(obj->get(), key_size, &attr, 1);
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", res);
+    return res;
+}
+
+// First pass over the components: each one's length, and the key data's total size.
+TEE_Result component_lengths(TEE_ObjectHandle obj, uint32_t key_size, uint32_t lengths[kRsaComponents], uint64_t *total,
+                             int32_t *error) {
+    heap_buf scratch(true);
+    if (!scratch.alloc(key_size / 8)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return TEE_SUCCESS;
+    }
+    *total = 4;
+    for (uint32_t i = 0; i < kRsaComponents; ++i) {
+        lengths[i] = scratch.len();
+        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], scratch.get(), &lengths[i]);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
+                        res);
+            return res;
+        }
+        *total += 4 + uint64_t{lengths[i]};
+    }
+    return TEE_SUCCESS;
+}
+
+// Second pass: the key size, then each component straight behind its length word.
+TEE_Result write_components(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t lengths[kRsaComponents],
+                            heap_buf *buf, int32_t *error) {
+    byte_writer w(buf->get(), buf->len());
+    if (!w.write_u32(key_size, "rsa_generate_key"))
+        return TEE_ERROR_GENERIC;
+    for (uint32_t i = 0; i < kRsaComponents; ++i) {
+        uint8_t *at = nullptr;
+        if (!w.write_u32(lengths[i], "rsa_generate_key") || !w.reserve(lengths[i], &at, "rsa_generate_key"))
+            return TEE_ERROR_GENERIC;
+        uint32_t got = lengths[i];
+        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], at, &got);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
+                        res);
+            return res;
+        }
+        if (got != lengths[i]) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Buffer size modified, before %dB, after %dB",
+                        static_cast<int>(lengths[i]), static_cast<int>(got));
+            *error = KM_ERROR_UNKNOWN_ERROR;
+            return TEE_SUCCESS;
+        }
+    }
+    return TEE_SUCCESS;
+}
+
+} // namespace
+
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    heap_buf buf(true);
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
-    *key_data = nullptr;
-    *key_data_len = 0;
-    *error = KM_ERROR_OK;
     do {
         res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
         if (res != TEE_SUCCESS || *error)
             break;
-        const key_param_t *exponent = key_param_set_find_unique(params, KM_TAG_RSA_PUBLIC_EXPONENT);
-        if (!exponent) {
-            KM_ERR("No or too many KM_TAG_RSA_PUBLIC_EXPONENT specified");
-            *error = KM_ERROR_INVALID_ARGUMENT;
+        uint64_t exponent = 0;
+        uint32_t key_size = 0;
+        if (!generation_params(params, &exponent, &key_size, error))
             break;
-        }
-        uint8_t e[8];
-        put_u64be(e, exponent->long_integer);
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (!size) {
-            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const uint32_t key_size = size->integer;
-        if (!valid_key_size(key_size)) {
-            KM_ERR("Invalid RSA key size %d", static_cast<int>(key_size));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
         object_guard obj;
-        res = TEE_AllocateTransientObject(TEE_TYPE_RSA_KEYPAIR, key_size, obj.out());
-        if (res != TEE_SUCCESS) {
-            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+        res = generate_pair(key_size, exponent, &obj);
+        if (res != TEE_SUCCESS)
             break;
-        }
-        TEE_Attribute attr{};
-        TEE_InitRefAttribute(&attr, TEE_ATTR_RSA_PUBLIC_EXPONENT, e, sizeof e);
-        res = TEE_GenerateKey(obj.get(), key_size, &attr, 1);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GenerateKey failed with 0x%08x\n", res);
-            break;
-        }
-        // First pass: the length of every component.
         uint32_t lengths[kRsaComponents] = {};
-        uint64_t total = 4;
-        {
-            heap_buf scratch(true);
-            if (!scratch.alloc(key_size / 8)) {
-                KM_ERR("Out of memory");
-                *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-                break;
-            }
-            for (uint32_t i = 0; i < kRsaComponents && res == TEE_SUCCESS; ++i) {
-                lengths[i] = scratch.len();
-                res = TEE_GetObjectBufferAttribute(obj.get(), kAttributeIds[i], scratch.get(), &lengths[i]);
-                total += 4 + uint64_t{lengths[i]};
-            }
-            if (res != TEE_SUCCESS) {
-                KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
-                break;
-            }
-        }
+        uint64_t total = 0;
+        res = component_lengths(obj.get(), key_size, lengths, &total, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
         if (total > UINT32_MAX || !buf.alloc(static_cast<uint32_t>(total))) {
             KM_ERR("Out of memory");
             res = TEE_ERROR_OUT_OF_MEMORY;
             break;
         }
-        // Second pass: each component straight behind its length word.
-        byte_writer w(buf.get(), buf.len());
-        if (!w.write_u32(key_size)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        bool written = true;
-        for (uint32_t i = 0; i < kRsaComponents && written; ++i) {
-            uint8_t *at = nullptr;
-            if (!w.write_u32(lengths[i]) || !w.reserve(lengths[i], &at)) {
-                res = TEE_ERROR_GENERIC;
-                written = false;
-                break;
-            }
-            uint32_t got = lengths[i];
-            res = TEE_GetObjectBufferAttribute(obj.get(), kAttributeIds[i], at, &got);
-            if (res != TEE_SUCCESS) {
-                KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
-                written = false;
-            } else if (got != lengths[i]) {
-                KM_ERR("Buffer size modified, before %dB, after %dB", static_cast<int>(lengths[i]),
-                       static_cast<int>(got));
-                *error = KM_ERROR_UNKNOWN_ERROR;
-                written = false;
-            }
-        }
-        done = written;
+        res = write_components(obj.get(), key_size, lengths, &buf, error);
+        done = res == TEE_SUCCESS && *error == KM_ERROR_OK;
     } while (false);
-    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
+    return out.settle(res, done);
 }
 
 TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    heap_buf buf(true);
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
     bool done = false;
     TEE_Result res = TEE_SUCCESS;
-    *key_data = nullptr;
-    *key_data_len = 0;
-    *error = KM_ERROR_OK;
     do {
         byte_reader r(material, material_len);
         components_t c{};
@@ -244,7 +267,7 @@ TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *mate
         TEE_MemMove(buf.get() + 4, material, consumed);
         done = true;
     } while (false);
-    return provider_settle_key(res, done, error, &buf, key_data, key_data_len);
+    return out.settle(res, done);
 }
 
 TEE_Result rsa_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
@@ -283,7 +306,10 @@ TEE_Result rsa_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_
     object_guard key;
     operation_guard op;
     uint32_t key_size = 0;
+    const uint32_t capacity = *out_len;
     *error = KM_ERROR_UNKNOWN_ERROR;
+    // Whatever fails, the caller is never told of more bytes than it gave room for.
+    *out_len = 0;
     int32_t ignored = 0;
     if (rsa_resolve_key_data(key_data, key_data_len, key.out(), &key_size, &ignored) != TEE_SUCCESS)
         KM_ERR("Resolve key data failed");
@@ -291,21 +317,16 @@ TEE_Result rsa_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_
         KM_ERR("resolve key from data stream error\n");
         return TEE_SUCCESS;
     }
-    TEE_Result res = TEE_AllocateOperation(op.out(), TEE_ALG_RSA_NOPAD, TEE_MODE_EXPORT, key_size);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_AllocateOperation failed: %08x\n", res);
+    if (keyed_operation(op.out(), TEE_ALG_RSA_NOPAD, TEE_MODE_EXPORT, key_size, key.get(), tee_call_texts::prefixed) !=
+        TEE_SUCCESS)
         return TEE_SUCCESS;
-    }
-    res = TEE_SetOperationKey(op.get(), key.get());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_SetOperationKey failed: %08x\n", res);
-        return TEE_SUCCESS;
-    }
-    res = TEE_AsymmetricExport(op.get(), TEE_EXPORT_RSA_PUBLIC_KEY_DER, out, out_len);
+    uint32_t len = capacity;
+    TEE_Result res = TEE_AsymmetricExport(op.get(), TEE_EXPORT_RSA_PUBLIC_KEY_DER, out, &len);
     if (res != TEE_SUCCESS) {
         KM_ERR("TEE_AsymmetricExport failed: %08x\n", res);
         return TEE_SUCCESS;
     }
+    *out_len = len;
     *error = KM_ERROR_OK;
     return TEE_SUCCESS;
 }
@@ -314,29 +335,95 @@ TEE_Result rsa_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_
 
 namespace {
 
-// The first steps every RSA operation takes: the key object, a buffer of one
-// block (key size / 8 bytes) and the single padding of the begin parameters.
-// False, logged in the caller's name, on failure; what was made stays in the
-// outputs for the record's free.
-bool rsa_operation_start(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
-                         TEE_ObjectHandle *key, uint32_t *key_size, uint8_t **block, const key_param_t **padding,
-                         int32_t *error, const char *func) {
-    if (rsa_resolve_key_data(key_data, key_data_len, key, key_size, error) != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+// The first steps of every RSA create: the record of fns's kind, its key
+// object, its one-block buffer, and the single padding and digest of the
+// begin parameters (a digest is required for signatures). Null on failure,
+// logged in the caller's name, with what was made released quietly.
+rsa_operation_t *rsa_record_start(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                                  bool digest_required, int32_t oom_error, int32_t *error, const operation_fns_t *fns,
+                                  const char *func) {
+    operation_t *header = operation_record_alloc(fns, func);
+    if (!header) {
+        if (oom_error)
+            *error = oom_error;
+        return nullptr;
+    }
+    auto *op = operation_record<rsa_operation_t>(header);
+    bool ok = false;
+    do {
+        if (rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+            break;
+        }
+        op->block = static_cast<uint8_t *>(ta_malloc(op->key_size / 8));
+        if (!op->block) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+            break;
+        }
+        const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
+        if (!padding) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
+        if (!digest && digest_required) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        op->padding = padding->enumerated;
+        op->digest = digest ? digest->enumerated : static_cast<uint32_t>(KM_DIGEST_NONE);
+        ok = true;
+    } while (false);
+    if (ok)
+        return op;
+    operation_destroy(header, record_state::partial);
+    return nullptr;
+}
+
+// The last step of every RSA create: the keyed RSA operation. The record
+// (header) or null, with the record destroyed on failure.
+operation_t *rsa_record_finish(rsa_operation_t *op, bool ok, uint32_t algorithm, uint32_t mode, const char *func) {
+    if (ok && keyed_operation(&op->operation, algorithm, mode, op->key_size, op->key, tee_call_texts::standard, func) ==
+                  TEE_SUCCESS)
+        return &op->header;
+    operation_destroy(&op->header, record_state::partial);
+    return nullptr;
+}
+
+} // namespace
+
+namespace {
+
+// The TEE algorithm and mode of a signature operation, from its padding and
+// digest; false with *error set when the pair is refused.
+bool signature_algorithm(rsa_signature_operation_t *op, bool signing, const digest_row_t **row, uint32_t *algorithm,
+                         uint32_t *mode, int32_t *error, const char *func) {
+    const uint32_t key_bytes = op->key_size / 8;
+    if (op->padding != KM_PAD_NONE && op->padding != KM_PAD_RSA_PSS && op->padding != KM_PAD_RSA_PKCS1_1_5_SIGN) {
+        *error = KM_ERROR_UNSUPPORTED_PADDING_MODE;
         return false;
     }
-    *block = static_cast<uint8_t *>(ta_malloc(*key_size / 8));
-    if (!*block) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    if (op->digest > KM_DIGEST_SHA_2_512) {
+        *error = KM_ERROR_UNSUPPORTED_DIGEST;
         return false;
     }
-    *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
-    if (!*padding) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+    *row = digest_row(op->digest);
+    if ((op->padding == KM_PAD_NONE && *row) || (op->padding == KM_PAD_RSA_PSS && (!*row || !(*row)->pss))) {
+        *error = KM_ERROR_INCOMPATIBLE_DIGEST;
         return false;
     }
+    if (op->padding == KM_PAD_RSA_PSS && (*row)->length + 22 > key_bytes) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Too short key to fit digest, flag and salt, key_size %d, need %d",
+                    static_cast<int>(op->key_size), static_cast<int>(((*row)->length + 22) * 8));
+        *error = KM_ERROR_INCOMPATIBLE_DIGEST;
+        return false;
+    }
+    // Without a digest the block is built here and run through raw RSA.
+    *algorithm = !*row ? TEE_ALG_RSA_NOPAD : (op->padding == KM_PAD_RSA_PSS ? (*row)->pss : (*row)->pkcs1);
+    *mode = signing ? (*row ? TEE_MODE_SIGN : TEE_MODE_DECRYPT) : (*row ? TEE_MODE_VERIFY : TEE_MODE_ENCRYPT);
     return true;
 }
 
@@ -344,83 +431,25 @@ bool rsa_operation_start(const uint8_t *key_data, uint32_t key_data_len, keymast
 
 operation_t *rsa_signature_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                   bool signing, int32_t *error, const operation_fns_t *fns, const char *func) {
-    auto *op = reinterpret_cast<rsa_signature_operation_t *>(operation_record_alloc(sizeof(rsa_signature_operation_t), fns));
-    if (!op) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-        // The verification twin leaves the error unset: begin then reports an unknown error.
-        if (signing)
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    // The verification twin leaves the error of a missing record unset: begin then reports an unknown error.
+    rsa_operation_t *base = rsa_record_start(key_data, key_data_len, in_params, true,
+                                             signing ? KM_ERROR_MEMORY_ALLOCATION_FAILED : 0, error, fns, func);
+    if (!base)
         return nullptr;
-    }
-    bool ok = false;
-    do {
-        const key_param_t *padding = nullptr;
-        if (!rsa_operation_start(key_data, key_data_len, in_params, &op->key, &op->key_size, &op->message, &padding,
-                                 error, func))
-            break;
-        const uint32_t key_bytes = op->key_size / 8;
-        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
-        if (!digest) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        op->padding = padding->enumerated;
-        op->digest = digest->enumerated;
-        if (op->padding != KM_PAD_NONE && op->padding != KM_PAD_RSA_PSS && op->padding != KM_PAD_RSA_PKCS1_1_5_SIGN) {
-            *error = KM_ERROR_UNSUPPORTED_PADDING_MODE;
-            break;
-        }
-        if (op->digest > KM_DIGEST_SHA_2_512) {
-            *error = KM_ERROR_UNSUPPORTED_DIGEST;
-            break;
-        }
-        const digest_row_t *row = digest_row(op->digest);
-        uint32_t algorithm = TEE_ALG_RSA_NOPAD;
-        if (op->padding == KM_PAD_NONE && row) {
-            *error = KM_ERROR_INCOMPATIBLE_DIGEST;
-            break;
-        }
-        if (op->padding == KM_PAD_RSA_PSS && (!row || !row->pss)) {
-            *error = KM_ERROR_INCOMPATIBLE_DIGEST;
-            break;
-        }
-        if (row) {
-            algorithm = op->padding == KM_PAD_RSA_PSS ? row->pss : row->pkcs1;
-            TEE_Result res = TEE_AllocateOperation(&op->digest_operation, row->hash, TEE_MODE_DIGEST, 0);
-            if (res != TEE_SUCCESS) {
-                op->digest_operation = nullptr;
-                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
-                break;
-            }
-        }
-        if (op->padding == KM_PAD_RSA_PSS && row->length + 22 > key_bytes) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__,
-                        "Too short key to fit digest, flag and salt, key_size %d, need %d", static_cast<int>(op->key_size),
-                        static_cast<int>((row->length + 22) * 8));
-            *error = KM_ERROR_INCOMPATIBLE_DIGEST;
-            break;
-        }
-        // Without a digest the block is built here and run through raw RSA.
-        const uint32_t mode = signing ? (row ? TEE_MODE_SIGN : TEE_MODE_DECRYPT)
-                                      : (row ? TEE_MODE_VERIFY : TEE_MODE_ENCRYPT);
-        TEE_Result res = TEE_AllocateOperation(&op->operation, algorithm, mode, op->key_size);
+    auto *op = static_cast<rsa_signature_operation_t *>(base);
+    const digest_row_t *row = nullptr;
+    uint32_t algorithm = 0;
+    uint32_t mode = 0;
+    bool ok = signature_algorithm(op, signing, &row, &algorithm, &mode, error, func);
+    if (ok && row) {
+        TEE_Result res = TEE_AllocateOperation(&op->digest_operation, row->hash, TEE_MODE_DIGEST, 0);
         if (res != TEE_SUCCESS) {
-            op->operation = nullptr;
+            op->digest_operation = nullptr;
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
-            break;
+            ok = false;
         }
-        res = TEE_SetOperationKey(op->operation, op->key);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "SetOperationKey failed with 0x%08x\n", res);
-            break;
-        }
-        ok = true;
-    } while (false);
-    if (ok)
-        return &op->header;
-    rsa_signature_free(&op->header, fns->record_name, false, func);
-    return nullptr;
+    }
+    return rsa_record_finish(op, ok, algorithm, mode, func);
 }
 
 TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *input, uint32_t *input_len,
@@ -431,16 +460,16 @@ TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *in
     } else {
         const uint32_t key_bytes = op->key_size / 8;
         const uint32_t limit = op->padding == KM_PAD_RSA_PKCS1_1_5_SIGN ? key_bytes - 11 : key_bytes;
-        const uint64_t total = uint64_t{op->message_len} + n;
+        const uint64_t total = uint64_t{op->block_len} + n;
         if (total > limit) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Input too long to %s, key_size %d, input %dB", verb, static_cast<int>(op->key_size),
-                        static_cast<int>(total));
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Input too long to %s, key_size %d, input %dB", verb,
+                        static_cast<int>(op->key_size), static_cast<int>(total));
             *input_len = 0;
             *error = KM_ERROR_INVALID_INPUT_LENGTH;
             return TEE_SUCCESS;
         }
-        TEE_MemMove(op->message + op->message_len, input, n);
-        op->message_len += n;
+        TEE_MemMove(op->block + op->block_len, input, n);
+        op->block_len += n;
     }
     *error = KM_ERROR_OK;
     return TEE_SUCCESS;
@@ -448,19 +477,19 @@ TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *in
 
 TEE_Result rsa_signature_digest(rsa_signature_operation_t *op, const char *func) {
     uint32_t len = op->key_size / 8;
-    TEE_Result res = TEE_DigestDoFinal(op->digest_operation, nullptr, 0, op->message, &len);
+    TEE_Result res = TEE_DigestDoFinal(op->digest_operation, nullptr, 0, op->block, &len);
     if (res != TEE_SUCCESS) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "DigestDoFinal failed with 0x%08x\n", res);
         return res;
     }
-    op->message_len = len;
+    op->block_len = len;
     return TEE_SUCCESS;
 }
 
 void rsa_signature_block(rsa_signature_operation_t *op) {
     const uint32_t key_bytes = op->key_size / 8;
-    const uint32_t m = op->message_len;
-    uint8_t *b = op->message;
+    const uint32_t m = op->block_len;
+    uint8_t *b = op->block;
     TEE_MemMove(b + key_bytes - m, b, m);
     if (op->padding == KM_PAD_RSA_PKCS1_1_5_SIGN) {
         // 00 01 FF..FF 00 M: the update limit leaves at least eight 0xFF bytes.
@@ -471,115 +500,102 @@ void rsa_signature_block(rsa_signature_operation_t *op) {
     } else {
         TEE_MemFill(b, 0x00, key_bytes - m);
     }
-    op->message_len = key_bytes;
+    op->block_len = key_bytes;
 }
 
-void rsa_signature_free(operation_t *header, const char *record_name, bool soter, const char *func) {
-    if (!header) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free NULL %s", record_name);
-        return;
+void rsa_signature_release(operation_t *header, bool audit) {
+    rsa_operation_release(header, audit);
+    auto *op = operation_record<rsa_signature_operation_t>(header);
+    record_release r(header, audit);
+    r.operation(&op->digest_operation, false);
+    r.buffer(&op->soter_buf, op->soter_capacity, false);
+}
+
+bool rsa_output_alloc(heap_buf *out, uint32_t key_size, int32_t *error, const char *func) {
+    if (out->alloc(key_size / 8))
+        return true;
+    KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+    *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    return false;
+}
+
+TEE_Result rsa_raw(rsa_operation_t *op, rsa_raw_call call, const uint8_t *in, uint32_t in_len, uint8_t *out,
+                   uint32_t *out_len, int32_t *error, const char *func) {
+    uint32_t len = op->key_size / 8;
+    const TEE_Result res = call == rsa_raw_call::encrypt
+                               ? TEE_AsymmetricEncrypt(op->operation, nullptr, 0, in, in_len, out, &len)
+                               : TEE_AsymmetricDecrypt(op->operation, nullptr, 0, in, in_len, out, &len);
+    if (res == TEE_ERROR_BAD_PARAMETERS) {
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return TEE_SUCCESS;
     }
-    auto *op = reinterpret_cast<rsa_signature_operation_t *>(header);
-    if (op->key)
-        TEE_FreeTransientObject(op->key);
-    if (op->operation)
-        TEE_FreeOperation(op->operation);
-    if (!op->key || !op->operation || !op->message)
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
-    if (op->digest_operation)
-        TEE_FreeOperation(op->digest_operation);
-    ta_free_wiped(op->message, op->key_size / 8);
-    if (soter)
-        ta_free(op->soter_buf);
-    ta_free(op);
+    if (res != TEE_SUCCESS) {
+        if (call == rsa_raw_call::encrypt)
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "TEE_AsymmetricEncrypt failed with 0x%08x", res);
+        else if (call == rsa_raw_call::decrypt)
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "TEE_AsymmetricDecrypt failed with 0x%08x", res);
+        else
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "TEE_AsymmetricDecrypt return 0x%08x", res);
+        return res;
+    }
+    *out_len = len;
+    return TEE_SUCCESS;
+}
+
+void rsa_left_pad(uint8_t *out, uint32_t *len, uint32_t key_size) {
+    right_align(out, *len, key_size / 8);
+    if (*len < key_size / 8)
+        *len = key_size / 8;
 }
 
 /* ---- encryption ---------------------------------------------------------- */
 
 operation_t *rsa_cipher_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func) {
-    auto *op = reinterpret_cast<rsa_cipher_operation_t *>(operation_record_alloc(sizeof(rsa_cipher_operation_t), fns));
-    if (!op) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+    rsa_operation_t *op = rsa_record_start(key_data, key_data_len, in_params, false, 0, error, fns, func);
+    if (!op)
         return nullptr;
-    }
-    bool ok = false;
-    do {
-        const key_param_t *padding = nullptr;
-        if (!rsa_operation_start(key_data, key_data_len, in_params, &op->key, &op->key_size, &op->input, &padding,
-                                 error, func))
-            break;
-        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
-        op->padding = padding->enumerated;
-        op->digest = digest ? digest->enumerated : static_cast<uint32_t>(KM_DIGEST_NONE);
-        if (op->padding != KM_PAD_NONE && op->padding != KM_PAD_RSA_PKCS1_1_5_ENCRYPT && op->padding != KM_PAD_RSA_OAEP) {
-            *error = KM_ERROR_UNSUPPORTED_PADDING_MODE;
-            break;
-        }
-        if (op->digest > KM_DIGEST_SHA_2_512) {
-            *error = KM_ERROR_UNSUPPORTED_DIGEST;
-            break;
-        }
+    uint32_t algorithm = 0;
+    if (op->padding != KM_PAD_NONE && op->padding != KM_PAD_RSA_PKCS1_1_5_ENCRYPT && op->padding != KM_PAD_RSA_OAEP) {
+        *error = KM_ERROR_UNSUPPORTED_PADDING_MODE;
+    } else if (op->digest > KM_DIGEST_SHA_2_512) {
+        *error = KM_ERROR_UNSUPPORTED_DIGEST;
+    } else {
         const digest_row_t *row = digest_row(op->digest);
-        uint32_t algorithm = 0;
         if (op->padding == KM_PAD_RSA_OAEP)
             algorithm = row ? row->oaep : 0;
         else if (!row)
             algorithm = op->padding == KM_PAD_NONE ? TEE_ALG_RSA_NOPAD : TEE_ALG_RSAES_PKCS1_V1_5;
-        if (!algorithm) {
+        if (!algorithm)
             *error = KM_ERROR_INCOMPATIBLE_DIGEST;
-            break;
-        }
-        TEE_Result res = TEE_AllocateOperation(&op->operation, algorithm, mode, op->key_size);
-        if (res != TEE_SUCCESS) {
-            op->operation = nullptr;
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
-            break;
-        }
-        res = TEE_SetOperationKey(op->operation, op->key);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "SetOperationKey failed with 0x%08x\n", res);
-            break;
-        }
-        ok = true;
-    } while (false);
-    if (ok)
-        return &op->header;
-    rsa_cipher_free(&op->header, fns->record_name, func);
-    return nullptr;
+    }
+    return rsa_record_finish(op, algorithm != 0, algorithm, mode, func);
 }
 
 TEE_Result rsa_cipher_update(operation_t *header, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
                              int32_t *error, const char *verb, const char *func) {
-    auto *op = reinterpret_cast<rsa_cipher_operation_t *>(header);
+    auto *op = operation_record<rsa_cipher_operation_t>(header);
     *output_len = 0;
-    const uint64_t total = uint64_t{op->input_len} + *input_len;
+    const uint64_t total = uint64_t{op->block_len} + *input_len;
     if (total > op->key_size / 8) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Input too long to %s, key_size %d, input %dB", verb, static_cast<int>(op->key_size), static_cast<int>(total));
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Input too long to %s, key_size %d, input %dB", verb,
+                    static_cast<int>(op->key_size), static_cast<int>(total));
         *input_len = 0;
         *error = KM_ERROR_INVALID_INPUT_LENGTH;
         return TEE_SUCCESS;
     }
-    TEE_MemMove(op->input + op->input_len, input, *input_len);
-    op->input_len += *input_len;
+    TEE_MemMove(op->block + op->block_len, input, *input_len);
+    op->block_len += *input_len;
     *error = KM_ERROR_OK;
     return TEE_SUCCESS;
 }
 
-void rsa_cipher_free(operation_t *header, const char *record_name, const char *func) {
-    if (!header) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free NULL %s", record_name);
-        return;
-    }
-    auto *op = reinterpret_cast<rsa_cipher_operation_t *>(header);
-    if (op->key)
-        TEE_FreeTransientObject(op->key);
-    if (op->operation)
-        TEE_FreeOperation(op->operation);
-    if (!op->key || !op->operation || !op->input)
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Try to free invalid %s", record_name);
-    ta_free_wiped(op->input, op->key_size / 8);
-    ta_free(op);
+void rsa_operation_release(operation_t *header, bool audit) {
+    auto *op = operation_record<rsa_operation_t>(header);
+    record_release r(header, audit);
+    r.object(&op->key);
+    r.operation(&op->operation);
+    r.buffer(&op->block, op->key_size / 8);
 }
 
 /* ---- the provider --------------------------------------------------------- */
@@ -612,46 +628,33 @@ uint32_t sign_get_digest(keymaster_key_param_set_t *in_params, uint32_t *value) 
 
 using create_fn = decltype(purpose_ops_t::create_operation);
 
-constexpr purpose_ops_t cipher_table(create_fn create) {
-    return purpose_ops_t{list_count_none,             list_write_none,         list_count<kCipherPaddings>,
-                         list_write<kCipherPaddings>, list_count<kDigestList>, list_write<kDigestList>,
-                         create,                      param_getter_padding,    param_getter_none,
-                         cipher_get_digest};
+constexpr purpose_ops_t rsa_table(create_fn create, bool signing) {
+    const auto padding_count = signing ? list_count<kSignPaddings> : list_count<kCipherPaddings>;
+    const auto paddings = signing ? list_write<kSignPaddings> : list_write<kCipherPaddings>;
+    const auto get_digest = signing ? sign_get_digest : cipher_get_digest;
+    // clang-format off
+    return purpose_ops_t{.block_mode_count = list_count_none, .get_block_modes = list_write_none,
+        .padding_count = padding_count, .get_paddings = paddings,
+        .digest_count = list_count<kDigestList>, .get_digests = list_write<kDigestList>,
+        .create_operation = create,
+        .get_padding = param_getter_padding, .get_block_mode = param_getter_none, .get_digest = get_digest,
+    };
+    // clang-format on
 }
 
-constexpr purpose_ops_t sign_table(create_fn create) {
-    return purpose_ops_t{list_count_none,           list_write_none,         list_count<kSignPaddings>,
-                         list_write<kSignPaddings>, list_count<kDigestList>, list_write<kDigestList>,
-                         create,                    param_getter_padding,    param_getter_none,
-                         sign_get_digest};
-}
-
-const purpose_ops_t rsa_encrypt_ops = cipher_table(create_rsa_encrypt);
-const purpose_ops_t rsa_decrypt_ops = cipher_table(create_rsa_decrypt);
-const purpose_ops_t rsa_sign_ops = sign_table(create_rsa_sign);
-const purpose_ops_t rsa_verify_ops = sign_table(create_rsa_verify);
-
-const purpose_ops_t *rsa_get_purpose_ops(uint32_t purpose) {
-    switch (purpose) {
-    case KM_PURPOSE_ENCRYPT:
-        return &rsa_encrypt_ops;
-    case KM_PURPOSE_DECRYPT:
-        return &rsa_decrypt_ops;
-    case KM_PURPOSE_SIGN:
-        return &rsa_sign_ops;
-    case KM_PURPOSE_VERIFY:
-        return &rsa_verify_ops;
-    default:
-        return nullptr;
-    }
-}
+const purpose_ops_t rsa_encrypt_ops = rsa_table(create_rsa_encrypt, false);
+const purpose_ops_t rsa_decrypt_ops = rsa_table(create_rsa_decrypt, false);
+const purpose_ops_t rsa_sign_ops = rsa_table(create_rsa_sign, true);
+const purpose_ops_t rsa_verify_ops = rsa_table(create_rsa_verify, true);
 
 } // namespace
 
-const algorithm_provider_t rsa_provider = {
-    KM_ALGORITHM_RSA,           "RSA",
-    rsa_get_purpose_ops,        list_count<kImportFormats>,
-    list_write<kImportFormats>, list_count<kExportFormats>,
-    list_write<kExportFormats>, rsa_generate_key,
-    rsa_import_key,             rsa_export_key,
+// The table as the interface lists its slots, in pairs.
+// clang-format off
+const algorithm_provider_t rsa_provider = {.algorithm = KM_ALGORITHM_RSA, .name = "RSA",
+    .get_purpose_ops = purposes_of<&rsa_encrypt_ops, &rsa_decrypt_ops, &rsa_sign_ops, &rsa_verify_ops>,
+    .import_format_count = list_count<kImportFormats>, .get_import_formats = list_write<kImportFormats>,
+    .export_format_count = list_count<kExportFormats>, .get_export_formats = list_write<kExportFormats>,
+    .generate_key = rsa_generate_key, .import_key = rsa_import_key, .export_key = rsa_export_key,
 };
+// clang-format on

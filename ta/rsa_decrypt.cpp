@@ -14,31 +14,19 @@ TEE_Result rsa_decrypt_update(operation_t *op, keymaster_key_param_set_t *, cons
 
 TEE_Result rsa_decrypt_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *, uint32_t,
                               uint8_t **output, uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
-    auto *op = reinterpret_cast<rsa_decrypt_operation_t *>(header);
-    const uint32_t k = op->key_size / 8;
+    auto *op = operation_record<rsa_decrypt_operation_t>(header);
     *output = nullptr;
     *output_len = 0;
     heap_buf out(true);
-    if (!out.alloc(k)) {
-        KM_ERR("Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    if (!rsa_output_alloc(&out, op->key_size, error))
         return TEE_SUCCESS;
-    }
-    uint32_t len = k;
-    TEE_Result res = TEE_AsymmetricDecrypt(op->operation, nullptr, 0, op->input, op->input_len, out.get(), &len);
-    if (res == TEE_ERROR_BAD_PARAMETERS) {
-        *error = KM_ERROR_INVALID_ARGUMENT;
-        return TEE_SUCCESS;
-    }
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_AsymmetricDecrypt failed with 0x%08x", res);
+    uint32_t len = 0;
+    TEE_Result res = rsa_raw(op, rsa_raw_call::decrypt, op->block, op->block_len, out.get(), &len, error);
+    if (res != TEE_SUCCESS || *error)
         return res;
-    }
     if (op->padding == KM_PAD_NONE) {
         // Raw results come without leading zeros; give back the whole block.
-        TEE_MemMove(out.get() + k - len, out.get(), len);
-        TEE_MemFill(out.get(), 0, k - len);
-        len = k;
+        rsa_left_pad(out.get(), &len, op->key_size);
     }
     out.set_len(len);
     *output_len = len;
@@ -47,10 +35,8 @@ TEE_Result rsa_decrypt_finish(operation_t *header, keymaster_key_param_set_t *, 
     return TEE_SUCCESS;
 }
 
-void rsa_decrypt_free(operation_t *op) { rsa_cipher_free(op, "rsa_decrypt_operation_t", __func__); }
-
-const operation_fns_t kDecryptFns = {rsa_decrypt_free, rsa_decrypt_update, rsa_decrypt_finish,
-                                         "rsa_decrypt_operation_t"};
+const operation_fns_t kDecryptFns = operation_fns<rsa_decrypt_operation_t>(
+    "rsa_decrypt_operation_t", rsa_decrypt_update, rsa_decrypt_finish, rsa_operation_release);
 
 } // namespace
 

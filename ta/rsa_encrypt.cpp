@@ -14,17 +14,14 @@ TEE_Result rsa_encrypt_update(operation_t *op, keymaster_key_param_set_t *, cons
 
 TEE_Result rsa_encrypt_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *, uint32_t,
                               uint8_t **output, uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
-    auto *op = reinterpret_cast<rsa_encrypt_operation_t *>(header);
+    auto *op = operation_record<rsa_encrypt_operation_t>(header);
     const uint32_t k = op->key_size / 8;
-    const uint32_t m = op->input_len;
+    const uint32_t m = op->block_len;
     *output = nullptr;
     *output_len = 0;
     heap_buf out;
-    if (!out.alloc(k)) {
-        KM_ERR("Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    if (!rsa_output_alloc(&out, op->key_size, error))
         return TEE_SUCCESS;
-    }
     uint32_t overhead = 0;
     if (op->padding == KM_PAD_RSA_PKCS1_1_5_ENCRYPT) {
         overhead = 11;
@@ -43,29 +40,20 @@ TEE_Result rsa_encrypt_finish(operation_t *header, keymaster_key_param_set_t *, 
         *error = KM_ERROR_INVALID_INPUT_LENGTH;
         return TEE_SUCCESS;
     }
-    uint32_t len = k;
-    TEE_Result res = TEE_AsymmetricEncrypt(op->operation, nullptr, 0, op->input, m, out.get(), &len);
-    if (res == TEE_ERROR_BAD_PARAMETERS) {
-        *error = KM_ERROR_INVALID_ARGUMENT;
-        return TEE_SUCCESS;
-    }
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_AsymmetricEncrypt failed with 0x%08x", res);
+    uint32_t len = 0;
+    TEE_Result res = rsa_raw(op, rsa_raw_call::encrypt, op->block, m, out.get(), &len, error);
+    if (res != TEE_SUCCESS || *error)
         return res;
-    }
     // Ciphertexts are always k bytes, leading zeros included.
-    TEE_MemMove(out.get() + k - len, out.get(), len);
-    TEE_MemFill(out.get(), 0, k - len);
-    *output_len = k;
+    rsa_left_pad(out.get(), &len, op->key_size);
+    *output_len = len;
     *output = out.release();
     *error = KM_ERROR_OK;
     return TEE_SUCCESS;
 }
 
-void rsa_encrypt_free(operation_t *op) { rsa_cipher_free(op, "rsa_encrypt_operation_t", __func__); }
-
-const operation_fns_t kEncryptFns = {rsa_encrypt_free, rsa_encrypt_update, rsa_encrypt_finish,
-                                         "rsa_encrypt_operation_t"};
+const operation_fns_t kEncryptFns = operation_fns<rsa_encrypt_operation_t>(
+    "rsa_encrypt_operation_t", rsa_encrypt_update, rsa_encrypt_finish, rsa_operation_release);
 
 } // namespace
 

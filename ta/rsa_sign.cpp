@@ -7,28 +7,15 @@
 
 namespace {
 
-constexpr uint32_t kPssSaltDigestLength = 0xFFFFFFFFu;
-constexpr uint32_t kPssSaltLongest = 0xFFFFFFFEu;
-
 TEE_Result rsa_sign_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
                            uint8_t *, uint32_t *output_len, int32_t *error) {
     *output_len = 0;
-    return rsa_signature_buffer(reinterpret_cast<rsa_sign_operation_t *>(op), input, input_len, error,
-                                "sign", __func__);
-}
-
-// Hands back the signature left-padded to the modulus length: raw results
-// come without leading zero bytes, and verifiers expect k bytes.
-void right_align(uint8_t *out, uint32_t len, uint32_t key_bytes) {
-    if (len >= key_bytes)
-        return;
-    TEE_MemMove(out + key_bytes - len, out, len);
-    TEE_MemFill(out, 0, key_bytes - len);
+    return rsa_signature_buffer(operation_record<rsa_sign_operation_t>(op), input, input_len, error, "sign", __func__);
 }
 
 TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *, uint32_t,
                            uint8_t **output, uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
-    auto *op = reinterpret_cast<rsa_sign_operation_t *>(header);
+    auto *op = operation_record<rsa_sign_operation_t>(header);
     const uint32_t key_bytes = op->key_size / 8;
     heap_buf out;
     *output = nullptr;
@@ -38,45 +25,36 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
         res = rsa_signature_digest(op, __func__);
         if (res != TEE_SUCCESS)
             return res;
-        if (!out.alloc(key_bytes)) {
-            KM_ERR("Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        if (!rsa_output_alloc(&out, op->key_size, error))
             return TEE_SUCCESS;
-        }
         uint32_t len = key_bytes;
         TEE_Attribute salt{};
         uint32_t attr_count = 0;
         if (op->padding == KM_PAD_RSA_PSS) {
             const uint32_t h = rsa_digest_length(op->digest);
-            TEE_InitValueAttribute(&salt, TEE_ATTR_RSA_PSS_SALT_LENGTH,
-                                   (h + 1) * 2 <= key_bytes ? kPssSaltDigestLength : kPssSaltLongest, 0);
+            TEE_InitValueAttribute(
+                &salt, TEE_ATTR_RSA_PSS_SALT_LENGTH,
+                (h + 1) * 2 <= key_bytes ? TEE_RSA_PSS_SALT_DIGEST_LENGTH : TEE_RSA_PSS_SALT_MAX_OR_AUTO, 0);
             attr_count = 1;
         }
-        res = TEE_AsymmetricSignDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->message,
-                                       op->message_len, out.get(), &len);
+        res = TEE_AsymmetricSignDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block,
+                                       op->block_len, out.get(), &len);
         if (res != TEE_SUCCESS) {
             KM_ERR("AsymmetricSignDigest failed with 0x%08x\n", res);
             return res;
         }
         out.set_len(len);
     } else {
-        if (!out.alloc(key_bytes)) {
-            KM_ERR("Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        if (!rsa_output_alloc(&out, op->key_size, error))
             return TEE_SUCCESS;
-        }
         rsa_signature_block(op);
-        uint32_t len = key_bytes;
-        res = TEE_AsymmetricDecrypt(op->operation, nullptr, 0, op->message, key_bytes, out.get(), &len);
-        if (res == TEE_ERROR_BAD_PARAMETERS) {
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            return TEE_SUCCESS;
-        }
-        if (res != TEE_SUCCESS) {
-            KM_ERR("TEE_AsymmetricDecrypt return 0x%08x", res);
+        uint32_t len = 0;
+        res = rsa_raw(op, rsa_raw_call::sign, op->block, key_bytes, out.get(), &len, error);
+        if (res != TEE_SUCCESS || *error)
             return res;
-        }
-        right_align(out.get(), len, key_bytes);
+        // Verifiers expect k bytes; raw results come without leading zeros.
+        rsa_left_pad(out.get(), &len, op->key_size);
+        out.set_len(len);
     }
     *output_len = out.len();
     *output = out.release();
@@ -84,9 +62,8 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
     return TEE_SUCCESS;
 }
 
-void rsa_sign_free(operation_t *op) { rsa_signature_free(op, "rsa_sign_operation_t", true, __func__); }
-
-const operation_fns_t kSignFns = {rsa_sign_free, rsa_sign_update, rsa_sign_finish, "rsa_sign_operation_t"};
+const operation_fns_t kSignFns = operation_fns<rsa_sign_operation_t>("rsa_sign_operation_t", rsa_sign_update,
+                                                                     rsa_sign_finish, rsa_signature_release);
 
 } // namespace
 

@@ -4,17 +4,16 @@
  * public-key operation.
  */
 #include "rsa.h"
+#include "byte_io.h"
 #include "ta_log.h"
 
 namespace {
 
-constexpr uint32_t kPssSaltAny = 0xFFFFFFFEu;
-
 TEE_Result rsa_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
                              uint8_t *, uint32_t *output_len, int32_t *error) {
     *output_len = 0;
-    return rsa_signature_buffer(reinterpret_cast<rsa_verify_operation_t *>(op), input, input_len, error,
-                                "verify", __func__);
+    return rsa_signature_buffer(operation_record<rsa_verify_operation_t>(op), input, input_len, error, "verify",
+                                __func__);
 }
 
 // Unhashed signatures are checked as signing made them: the public-key result,
@@ -23,16 +22,13 @@ TEE_Result rsa_verify_update(operation_t *op, keymaster_key_param_set_t *, const
 TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *signature,
                              uint32_t signature_len, uint8_t **output, uint32_t *output_len,
                              keymaster_key_param_set_t *, int32_t *error) {
-    auto *op = reinterpret_cast<rsa_verify_operation_t *>(header);
+    auto *op = operation_record<rsa_verify_operation_t>(header);
     const uint32_t key_bytes = op->key_size / 8;
     *output = nullptr;
     *output_len = 0;
     heap_buf work(true);
-    if (!work.alloc(key_bytes)) {
-        KM_ERR("Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+    if (!rsa_output_alloc(&work, op->key_size, error))
         return TEE_SUCCESS;
-    }
     TEE_Result res = TEE_SUCCESS;
     if (op->digest_operation) {
         res = rsa_signature_digest(op, __func__);
@@ -41,11 +37,11 @@ TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, c
         TEE_Attribute salt{};
         uint32_t attr_count = 0;
         if (op->padding == KM_PAD_RSA_PSS) {
-            TEE_InitValueAttribute(&salt, TEE_ATTR_RSA_PSS_SALT_LENGTH, kPssSaltAny, 0);
+            TEE_InitValueAttribute(&salt, TEE_ATTR_RSA_PSS_SALT_LENGTH, TEE_RSA_PSS_SALT_MAX_OR_AUTO, 0);
             attr_count = 1;
         }
-        res = TEE_AsymmetricVerifyDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->message,
-                                         op->message_len, signature, signature_len);
+        res = TEE_AsymmetricVerifyDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block,
+                                         op->block_len, signature, signature_len);
         if (res == TEE_ERROR_SIGNATURE_INVALID) {
             *error = KM_ERROR_VERIFICATION_FAILED;
             return TEE_SUCCESS;
@@ -61,18 +57,13 @@ TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, c
         KM_ERR("AsymmetricEncrypt failed with 0x%08x\n", res);
         return res;
     }
-    const uint32_t pad = key_bytes - len;
-    uint8_t diff = 0;
-    for (uint32_t i = 0; i < key_bytes; ++i)
-        diff |= static_cast<uint8_t>(op->message[i] ^ (i < pad ? 0 : work.get()[i - pad]));
-    *error = diff == 0 ? KM_ERROR_OK : KM_ERROR_VERIFICATION_FAILED;
+    rsa_left_pad(work.get(), &len, op->key_size);
+    *error = bytes_equal_ct(op->block, work.get(), key_bytes) ? KM_ERROR_OK : KM_ERROR_VERIFICATION_FAILED;
     return TEE_SUCCESS;
 }
 
-void rsa_verify_free(operation_t *op) { rsa_signature_free(op, "rsa_verify_operation_t", false, __func__); }
-
-const operation_fns_t kVerifyFns = {rsa_verify_free, rsa_verify_update, rsa_verify_finish,
-                                        "rsa_verify_operation_t"};
+const operation_fns_t kVerifyFns = operation_fns<rsa_verify_operation_t>("rsa_verify_operation_t", rsa_verify_update,
+                                                                         rsa_verify_finish, rsa_signature_release);
 
 } // namespace
 

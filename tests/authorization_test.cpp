@@ -4,6 +4,9 @@
  * bootloader-only keys, caller nonces, and user authentication with auth
  * tokens minted from the platform's boot seed.
  */
+#include <algorithm>
+
+#include "authorization.h"
 #include "key_commands.h"
 #include "keymaster_defs.h"
 #include "ta_entry.h"
@@ -160,7 +163,7 @@ TEST_F(Authorization, MaxUsesPerBootAndTheUseLog) {
 }
 
 TEST_F(Authorization, LongBlobsAreTrackedByTheirDigest) {
-    // Application data makes the blob longer than a use-log entry.
+    // Through begin: a blob longer than an entry is counted like any other.
     ParamSet p;
     p.add(KM_TAG_MAX_USES_PER_BOOT, 1).add_bytes(KM_TAG_APPLICATION_DATA, Bytes(3000, 0x61));
     Bytes blob = key(p);
@@ -169,10 +172,21 @@ TEST_F(Authorization, LongBlobsAreTrackedByTheirDigest) {
     params.add_bytes(KM_TAG_APPLICATION_DATA, Bytes(3000, 0x61));
     EXPECT_TRUE(try_begin(blob, params).ok());
     EXPECT_EQ(try_begin(blob, params).error, KM_ERROR_KEY_MAX_OPS_EXCEEDED);
-    // Another long blob sharing the first 2048 bytes is another key.
-    Bytes other = blob;
-    other.back() ^= 1; // cannot open, but the use log sees it first
-    EXPECT_EQ(try_begin(other, params).res, TEE_ERROR_MAC_INVALID);
+
+    // Two valid blobs never share 2048 bytes, so the identifiers are fed to
+    // the use log directly: long ones that share their first 2048 bytes, or
+    // a long one and its own 2048-byte prefix, are different keys.
+    Bytes first(3000, 0x33);
+    Bytes second = first;
+    second.back() ^= 1;
+    Bytes prefix(first.begin(), first.begin() + 2048);
+    int32_t error = 0;
+    EXPECT_EQ(check_use_count_and_add(first.data(), 3000, 1, &error), 0u);
+    EXPECT_EQ(check_use_count_and_add(first.data(), 3000, 1, &error), 1u);
+    EXPECT_EQ(error, KM_ERROR_KEY_MAX_OPS_EXCEEDED);
+    EXPECT_EQ(check_use_count_and_add(second.data(), 3000, 1, &error), 0u) << "a different tail is another key";
+    EXPECT_EQ(check_use_count_and_add(prefix.data(), 2048, 1, &error), 0u) << "a prefix is another key";
+    EXPECT_EQ(check_use_count_and_add(first.data(), 2999, 1, &error), 0u) << "a shorter blob is another key";
 }
 
 TEST_F(Authorization, BootloaderOnlyKeysAreRefused) {
@@ -254,7 +268,8 @@ TEST_F(Authorization, TheTokenCacheHoldsSixteen) {
     Bytes blob = key(auth_key_params(true), false);
     // Sixteen distinct tokens of another user fill the cache.
     for (uint64_t i = 0; i < 16; ++i)
-        try_begin(blob, with_token(fresh_token(i + 1, kSid + 100)));
+        EXPECT_EQ(try_begin(blob, with_token(fresh_token(i + 1, kSid + 100))).error,
+                  KM_ERROR_KEY_USER_NOT_AUTHENTICATED);
     Bytes good = fresh_token(77);
     EXPECT_TRUE(try_begin(blob, with_token(good)).ok()) << "still accepted when given directly";
     EXPECT_EQ(try_begin(blob).error, KM_ERROR_KEY_USER_NOT_AUTHENTICATED) << "but not cached";
@@ -304,6 +319,85 @@ TEST_F(Authorization, ABadTokenFailsEvenForKeysWithoutAuthentication) {
     bad[40] ^= 1;
     EXPECT_EQ(try_begin(blob, with_token(bad)).error, KM_ERROR_INVALID_ARGUMENT);
     EXPECT_TRUE(try_begin(blob, with_token(fresh_token())).ok());
+}
+
+// A token is only as good as the MAC it is checked against: when that MAC
+// cannot be computed (no memory, a TEE failure), the token is refused and
+// never cached, whatever its own MAC bytes say.
+TEST_F(Authorization, ATokenIsRefusedWhenItsMacCannotBeComputed) {
+    Bytes blob = key(auth_key_params(true), false); // with a timeout: cached tokens would count
+    Bytes forged = mint_token(0, kSid, 0, kFingerprint, tee_host::clock::system_ms());
+    std::fill(forged.begin() + 37, forged.end(), 0);
+    EXPECT_EQ(try_begin(blob, with_token(forged)).error, KM_ERROR_INVALID_ARGUMENT);
+    int points = sweep_allocations("begin with an all-zero MAC", nullptr,
+                                   [&] { return try_begin(blob, with_token(forged)); },
+                                   {{TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT},
+                                    {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
+                                    {TEE_ERROR_OUT_OF_MEMORY, 0},
+                                    {TEE_ERROR_BAD_PARAMETERS, 0}});
+    EXPECT_GT(points, 3);
+    tee_host::trace::clear();
+    EXPECT_EQ(try_begin(blob).error, KM_ERROR_KEY_USER_NOT_AUTHENTICATED) << "the forged token was cached";
+}
+
+// Rate limits and use counts need a use-log entry; a full log refuses the
+// begin rather than letting the key run unlimited.
+TEST_F(Authorization, AFullUseLogRefusesRateLimitedKeys) {
+    ParamSet counted;
+    counted.add(KM_TAG_MAX_USES_PER_BOOT, 5);
+    for (int i = 0; i < 8; ++i)
+        ASSERT_TRUE(try_begin(key(counted)).ok()) << i;
+    ParamSet limited;
+    limited.add(KM_TAG_MIN_SECONDS_BETWEEN_OPS, 100);
+    Bytes ninth = key(limited);
+    for (int i = 0; i < 3; ++i) {
+        tee_host::trace::clear();
+        EXPECT_EQ(try_begin(ninth).error, KM_ERROR_TOO_MANY_OPERATIONS) << i;
+        EXPECT_TRUE(logged(TEE_TRACE_ERROR, "authorize_begin", "Too many use log")) << dump_log();
+    }
+
+    // An entry whose window has passed and that counts no use is taken over.
+    restart_instance();
+    for (int i = 0; i < 7; ++i)
+        ASSERT_TRUE(try_begin(key(counted)).ok()) << i;
+    ParamSet short_limit;
+    short_limit.add(KM_TAG_MIN_SECONDS_BETWEEN_OPS, 5);
+    Bytes a = key(short_limit);
+    Bytes b = key(short_limit);
+    EXPECT_TRUE(try_begin(a).ok());
+    EXPECT_EQ(try_begin(b).error, KM_ERROR_TOO_MANY_OPERATIONS) << "a's window is still open";
+    tee_host::clock::advance_ms(6000);
+    EXPECT_TRUE(try_begin(b).ok());
+    EXPECT_EQ(try_begin(b).error, KM_ERROR_KEY_RATE_LIMIT_EXCEEDED) << "b is limited, not unlimited";
+}
+
+// A begin that needs per-operation tokens keeps the deferred outcome until
+// the pool takes the operation: a later failure that names no error of its
+// own reports it.
+TEST_F(Authorization, TheDeferredOutcomeSurvivesALaterSilentFailure) {
+    Bytes blob = key(auth_key_params(false), false);
+    bool deferred_seen = false;
+    int points = sweep_allocations("begin of a per-operation key", nullptr,
+                                   [&] {
+                                       uint32_t h = 0;
+                                       Outcome o = begin(KM_PURPOSE_SIGN, blob, sign_params(), &h);
+                                       if (o.ok())
+                                           EXPECT_TRUE(abort(h).ok());
+                                       else
+                                           EXPECT_EQ(h, 0u);
+                                       deferred_seen = deferred_seen || o.error == KM_OP_AUTH_NEEDED;
+                                       return o;
+                                   },
+                                   {{TEE_SUCCESS, KM_OP_AUTH_NEEDED},
+                                    // once the key object is made, the provider has reset the error
+                                    {TEE_SUCCESS, KM_ERROR_UNKNOWN_ERROR},
+                                    // the blob's own buffers and parameters
+                                    {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
+                                    {TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT},
+                                    {TEE_ERROR_OUT_OF_MEMORY, 0},
+                                    {TEE_ERROR_BAD_PARAMETERS, 0}});
+    EXPECT_GT(points, 3);
+    EXPECT_TRUE(deferred_seen) << "the record's own allocation failure sets no error";
 }
 
 } // namespace

@@ -224,23 +224,22 @@ TEST_F(Marshal, OversizedCountsAndLengths) {
 
 TEST_F(Marshal, MarshalAllocationFailure) {
     build_example(KM_TAG_ASSOCIATED_DATA);
-    int points = sweep_allocations(nullptr,
-                                   [&] {
-                                       uint8_t *buf = nullptr;
-                                       uint32_t len = 1;
-                                       TEE_Result res = marshal(&set_, false, &buf, &len);
-                                       if (res == TEE_SUCCESS) {
-                                           ta_free(buf);
-                                       } else {
-                                           EXPECT_EQ(buf, nullptr);
-                                           EXPECT_EQ(len, 0u);
-                                       }
-                                       return res;
-                                   },
-                                   [&](int, TEE_Result res) {
-                                       EXPECT_EQ(res, TEE_ERROR_OUT_OF_MEMORY);
-                                       EXPECT_TRUE(logged_message("Out of memory, need 55B"));
-                                   });
+    int points = sweep_allocations(
+        "marshal", nullptr,
+        [&] {
+            uint8_t *buf = nullptr;
+            uint32_t len = 1;
+            TEE_Result res = marshal(&set_, false, &buf, &len);
+            if (res == TEE_SUCCESS) {
+                ta_free(buf);
+            } else {
+                EXPECT_EQ(buf, nullptr);
+                EXPECT_EQ(len, 0u);
+                EXPECT_TRUE(logged_message("Out of memory, need 55B"));
+            }
+            return Outcome{res, 0};
+        },
+        {{TEE_ERROR_OUT_OF_MEMORY, 0}});
     EXPECT_EQ(points, 1);
     EXPECT_EQ(extra_allocations(), 2u); // the set's own array and data
 }
@@ -250,23 +249,24 @@ TEST_F(Marshal, UnmarshalAllocationFailures) {
                    "e8030090 00000000 00000000 00000000 02000000 00000000 6162"
                    "02000010 00000000 80000000 000000000000000000000000"
                    "e9030090 00000000 00000000 00000000 01000000 00000000 63");
+    int n = 0;
     int points = sweep_allocations(
-        [] { tee_host::trace::clear(); },
+        "unmarshal", [&] { tee_host::trace::clear(); },
         [&] {
+            ++n;
             keymaster_key_param_set_t back{};
             TEE_Result res = unmarshal(in.data(), static_cast<uint32_t>(in.size()), &back);
-            if (res == TEE_SUCCESS)
+            if (res == TEE_SUCCESS) {
                 key_param_set_release(&back);
-            else
-                EXPECT_EQ(back.params, nullptr);
-            return res;
-        },
-        [&](int n, TEE_Result res) {
-            EXPECT_EQ(res, TEE_ERROR_OUT_OF_MEMORY) << n;
-            EXPECT_EQ(extra_allocations(), 0u) << n;
-            const char *expected = n == 1 ? "Out of memory" : (n == 2 ? "Out of memory, require 2B" : "Out of memory, require 1B");
+                return Outcome{res, 0};
+            }
+            EXPECT_EQ(back.params, nullptr);
+            const char *expected =
+                n == 1 ? "Out of memory" : (n == 2 ? "Out of memory, require 2B" : "Out of memory, require 1B");
             EXPECT_TRUE(logged(TEE_TRACE_ERROR, "unmarshal", expected)) << n << "\n" << dump_log();
-        });
+            return Outcome{res, 0};
+        },
+        {{TEE_ERROR_OUT_OF_MEMORY, 0}});
     EXPECT_EQ(points, 3); // the array and the two byte strings
 }
 

@@ -291,50 +291,46 @@ TEST_F(Operation, OperationsOutliveTheirSessionAndEndWithTheInstance) {
     (void)h;
 }
 
-// Every allocation of begin, update and finish fails in turn: each run ends
-// in a clean refusal, with the operation either fully alive or gone.
+// Every allocation of begin, update and finish fails in turn: each run
+// ends in the shortage's own report, with the operation either fully alive
+// or gone, and nothing held.
 TEST_F(Operation, AllocationFailuresInEveryCommand) {
     Bytes blob = import_hmac(4, sample(32, 10));
-    const size_t base = extra_allocations();
-    auto clean = [&](const char *what) {
-        return [&, what](int n, TEE_Result) {
-            EXPECT_EQ(extra_allocations(), base) << what << " failure point " << n;
-        };
-    };
-    int points = sweep_allocations(nullptr,
-                                   [&] {
-                                       uint32_t h = 0;
-                                       Outcome o = begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h);
-                                       bool fired = tee_host::heap::injected_failure_fired();
-                                       if (o.ok())
-                                           abort(h);
-                                       if (fired) {
-                                           EXPECT_FALSE(o.ok());
-                                       }
-                                       return o.res;
-                                   },
-                                   clean("begin"));
+    const Outcome oom{TEE_ERROR_OUT_OF_MEMORY, 0};
+    // A record that cannot be allocated sets no error of its own.
+    const Outcome no_record{TEE_SUCCESS, KM_ERROR_UNKNOWN_ERROR};
+    int points = sweep_allocations(
+        "begin", nullptr,
+        [&] {
+            uint32_t h = 0;
+            Outcome o = begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h);
+            if (o.ok())
+                abort(h);
+            return o;
+        },
+        {oom, {TEE_ERROR_BAD_PARAMETERS, 0}, no_record, {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
+         {TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}});
     EXPECT_GT(points, 3);
 
     for (uint32_t cmd : {KM_CMD_UPDATE, KM_CMD_FINISH}) {
         uint32_t h = 0;
-        int n = sweep_allocations([&] { ASSERT_TRUE(begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h).ok()); },
-                                  [&] {
-                                      Outcome o = cmd == KM_CMD_UPDATE ? update(h, {1, 2, 3}) : finish(h);
-                                      bool fired = tee_host::heap::injected_failure_fired();
-                                      // Alive after a success of update, gone after any failure or finish.
-                                      Outcome gone = abort(h);
-                                      if (fired || cmd == KM_CMD_FINISH) {
-                                          EXPECT_EQ(gone.error, KM_ERROR_INVALID_OPERATION_HANDLE);
-                                      } else {
-                                          EXPECT_TRUE(gone.ok());
-                                      }
-                                      if (fired) {
-                                          EXPECT_FALSE(o.ok());
-                                      }
-                                      return o.res;
-                                  },
-                                  clean(cmd == KM_CMD_UPDATE ? "update" : "finish"));
+        const bool updating = cmd == KM_CMD_UPDATE;
+        int n = sweep_allocations(
+            updating ? "update" : "finish",
+            [&] { ASSERT_TRUE(begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h).ok()); },
+            [&] {
+                Outcome o = updating ? update(h, {1, 2, 3}) : finish(h);
+                const bool fired = tee_host::heap::injected_failure_fired();
+                // Gone after any failure of update and after every finish; alive otherwise.
+                Outcome gone = abort(h);
+                if (fired || !updating) {
+                    EXPECT_EQ(gone.error, KM_ERROR_INVALID_OPERATION_HANDLE);
+                } else {
+                    EXPECT_TRUE(gone.ok());
+                }
+                return o;
+            },
+            {{TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}, {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED}, oom});
         EXPECT_GT(n, 0) << cmd;
     }
 }

@@ -104,12 +104,12 @@ TEST_F(ParamSet, DumpShowsEachTypeAndNeverByteStringContents) {
     add(key_param_enum(0xB0000001, 1));
     add(key_param_enum(0, 0));
     tee_host::trace::clear();
-    _keymaster_dump_key_param_set("caller.cpp", 42, &set_);
+    keymaster_dump_key_param_set("caller.cpp", 42, &set_);
 
     std::vector<std::string> got;
     for (const auto &l : tee_host::trace::captured()) {
         EXPECT_EQ(l.level, TEE_TRACE_DEBUG);
-        EXPECT_EQ(l.func, "_keymaster_dump_key_param_set");
+        EXPECT_EQ(l.func, "keymaster_dump_key_param_set");
         EXPECT_EQ(l.formatted.find("secret-owner"), std::string::npos);
         got.push_back(l.message);
     }

@@ -14,33 +14,98 @@
 struct operation_t;
 
 /*
- * operation_t - the leading part of every operation record; the provider's
- * own context follows it in the same allocation. key_params is owned by the
- * record and released by the command layer before free.
+ * operation_fns_t - the one constant table of an operation record's
+ * functions. Every record of a kind points at the same table.
+ *
+ * update, finish: the provider's steps (null: not offered).
+ * release: frees what the record holds (TEE objects and operations,
+ * buffers) but neither the record itself nor its key_params. With audit
+ * set, each member that a complete record must hold and that is missing
+ * is logged once as "Try to free invalid <record_name>".
  */
-struct operation_t {
-    keymaster_key_param_set_t key_params;
-    void (*free)(operation_t *op);
+struct operation_fns_t {
+    const char *record_name;
+    uint32_t record_size; // bytes of the whole record, header included
     TEE_Result (*update)(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *input,
                          uint32_t *input_len, uint8_t *output, uint32_t *output_len, int32_t *error);
     TEE_Result (*finish)(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *signature,
                          uint32_t signature_len, uint8_t **output, uint32_t *output_len,
                          keymaster_key_param_set_t *out_params, int32_t *error);
+    void (*release)(operation_t *op, bool audit);
 };
 
 /*
- * operation_fns_t - the functions a provider's operation records carry,
- * and the record name their log lines use.
+ * operation_t - the leading part of every operation record; the provider's
+ * own context follows it in the same allocation. key_params is owned by the
+ * record once begin has moved it there.
  */
-struct operation_fns_t {
-    void (*free)(operation_t *op);
-    decltype(operation_t::update) update;
-    decltype(operation_t::finish) finish;
-    const char *record_name;
+struct operation_t {
+    keymaster_key_param_set_t key_params;
+    const operation_fns_t *fns;
 };
 
-/* operation_record_alloc - a zero-filled record of size bytes with its functions set; null when out of memory. */
-operation_t *operation_record_alloc(uint32_t size, const operation_fns_t *fns);
+/*
+ * operation_record_alloc - a zero-filled record of fns->record_size bytes
+ * pointing at fns; null (logged "Out of memory" in the caller's name) when
+ * the heap is exhausted. The record ends only through operation_destroy.
+ */
+operation_t *operation_record_alloc(const operation_fns_t *fns, const char *func = __builtin_FUNCTION());
+
+/*
+ * operation_fns - the table of a record type: its name in log lines, its
+ * size, and its three functions.
+ */
+template <typename Record>
+constexpr operation_fns_t operation_fns(const char *record_name, decltype(operation_fns_t::update) update,
+                                        decltype(operation_fns_t::finish) finish,
+                                        decltype(operation_fns_t::release) release) {
+    return operation_fns_t{
+        .record_name = record_name,
+        .record_size = sizeof(Record),
+        .update = update,
+        .finish = finish,
+        .release = release,
+    };
+}
+
+/* operation_record - the provider's view of a record built from its table. */
+template <typename Record> Record *operation_record(operation_t *op) {
+    return reinterpret_cast<Record *>(op);
+}
+
+/* How complete a record is when it is destroyed. */
+enum class record_state : uint8_t {
+    complete, // built by create_operation: missing members are logged
+    partial,  // create_operation's own failure path: released quietly
+};
+
+/*
+ * operation_destroy - the one way an operation record ends: releases its
+ * key_params, lets its table release what it holds, wipes and frees the
+ * record. A null record logs "Try to free NULL operation_t".
+ */
+void operation_destroy(operation_t *op, record_state state = record_state::complete);
+
+/*
+ * record_release - what a table's release function uses to free one member
+ * at a time: each call frees the member when present and clears it; a
+ * required member that is missing is logged when auditing.
+ */
+class record_release {
+  public:
+    record_release(const operation_t *op, bool audit, const char *func = __builtin_FUNCTION())
+        : op_(op), audit_(audit), func_(func) {}
+    void object(TEE_ObjectHandle *h, bool required = true);
+    void operation(TEE_OperationHandle *h, bool required = true);
+    /* buffer - frees *p after wiping len bytes of it. */
+    void buffer(uint8_t **p, uint32_t len, bool required = true);
+
+  private:
+    void missing(bool required) const;
+    const operation_t *op_;
+    bool audit_;
+    const char *func_;
+};
 
 struct purpose_ops_t {
     uint32_t (*block_mode_count)();
@@ -83,22 +148,37 @@ extern const algorithm_provider_t aes_provider;
 extern const algorithm_provider_t ec_provider;
 extern const algorithm_provider_t hmac_provider;
 
+/*
+ * purposes_of - a provider's get_purpose_ops over its tables listed by
+ * purpose value (KM_PURPOSE_ENCRYPT 0 to KM_PURPOSE_VERIFY 3), null for a
+ * purpose the provider lacks.
+ */
+template <const purpose_ops_t *...Tables> const purpose_ops_t *purposes_of(uint32_t purpose) {
+    constexpr const purpose_ops_t *tables[] = {Tables...};
+    return purpose < sizeof...(Tables) ? tables[purpose] : nullptr;
+}
+
 /* find_algorithm_provider - the first provider of that algorithm, or null. */
 const algorithm_provider_t *find_algorithm_provider(uint32_t algorithm);
 
 /*
  * find_purpose_ops - the purpose table of the first provider of that
  * algorithm that has get_purpose_ops; null when there is none or the
- * purpose is not supported.
+ * purpose is not supported. With provider given, *provider is that
+ * provider (null when no provider of the algorithm has get_purpose_ops),
+ * so callers can tell an unknown algorithm from an unknown purpose.
  */
-const purpose_ops_t *find_purpose_ops(uint32_t algorithm, uint32_t purpose);
+const purpose_ops_t *find_purpose_ops(uint32_t algorithm, uint32_t purpose,
+                                      const algorithm_provider_t **provider = nullptr);
 
 /*
  * Capability lists as slot functions: list_count<L> and list_write<L> for a
  * constant array L. Lists go out as little-endian u32s into buffers of any
  * alignment.
  */
-template <const auto &L> uint32_t list_count() { return static_cast<uint32_t>(sizeof(L) / sizeof(L[0])); }
+template <const auto &L> uint32_t list_count() {
+    return static_cast<uint32_t>(sizeof(L) / sizeof(L[0]));
+}
 template <const auto &L> void list_write(uint32_t *out) {
     auto *p = reinterpret_cast<uint8_t *>(out);
     for (uint32_t v : L) {
@@ -106,7 +186,9 @@ template <const auto &L> void list_write(uint32_t *out) {
         p += 4;
     }
 }
-inline uint32_t list_count_none() { return 0; }
+inline uint32_t list_count_none() {
+    return 0;
+}
 inline void list_write_none(uint32_t *) {}
 
 /* Parameter getters shared by several tables (0 and *value, or 1 for none). */
@@ -114,6 +196,26 @@ uint32_t param_getter_none(keymaster_key_param_set_t *in_params, uint32_t *value
 uint32_t param_getter_digest(keymaster_key_param_set_t *in_params, uint32_t *value);
 uint32_t param_getter_padding(keymaster_key_param_set_t *in_params, uint32_t *value);
 uint32_t param_getter_block_mode(keymaster_key_param_set_t *in_params, uint32_t *value);
+
+/* The digests EC and HMAC sign with: MD5 to SHA-512, never none. */
+constexpr uint32_t kSigningDigests[] = {KM_DIGEST_MD5,       KM_DIGEST_SHA1,      KM_DIGEST_SHA_2_224,
+                                        KM_DIGEST_SHA_2_256, KM_DIGEST_SHA_2_384, KM_DIGEST_SHA_2_512};
+
+/*
+ * digest_signing_table - the sign or verify table of EC and HMAC: no block
+ * modes or paddings, kSigningDigests, and the single digest of the request
+ * as the one value to authorize.
+ */
+constexpr purpose_ops_t digest_signing_table(decltype(purpose_ops_t::create_operation) create) {
+    // clang-format off
+    return purpose_ops_t{.block_mode_count = list_count_none, .get_block_modes = list_write_none,
+        .padding_count = list_count_none, .get_paddings = list_write_none,
+        .digest_count = list_count<kSigningDigests>, .get_digests = list_write<kSigningDigests>,
+        .create_operation = create,
+        .get_padding = param_getter_none, .get_block_mode = param_getter_none, .get_digest = param_getter_digest,
+    };
+    // clang-format on
+}
 
 /*
  * provider_set_origin - refuses a caller-supplied KM_TAG_ORIGIN (*error -38)
@@ -124,12 +226,35 @@ TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origi
                                const char *func = __builtin_FUNCTION());
 
 /*
- * provider_settle_key - the common exit of the key functions: on success
- * hands *buf over as the key data; otherwise a failure that set neither a
- * result nor an error becomes KM_ERROR_UNKNOWN_ERROR.
+ * key_output - the key data a provider's generate or import slot builds.
+ * It clears the slot's outputs and error when made; settle() is the slot's
+ * one exit: on success the buffer becomes the key data (the caller frees
+ * it), otherwise it is wiped and a failure that set neither a result nor
+ * an error becomes KM_ERROR_UNKNOWN_ERROR.
  */
-TEE_Result provider_settle_key(TEE_Result res, bool done, int32_t *error, heap_buf *buf, uint8_t **key_data,
-                               uint32_t *key_data_len);
+class key_output {
+  public:
+    key_output(uint8_t **key_data, uint32_t *key_data_len, int32_t *error)
+        : key_data_(key_data), key_data_len_(key_data_len), error_(error) {
+        *key_data = nullptr;
+        *key_data_len = 0;
+        *error = KM_ERROR_OK;
+    }
+    TEE_Result settle(TEE_Result res, bool done) {
+        settle_error(res, done, error_);
+        if (done && res == TEE_SUCCESS && *error_ == KM_ERROR_OK) {
+            *key_data_len_ = buf.len();
+            *key_data_ = buf.release();
+        }
+        return res;
+    }
+    heap_buf buf{true};
+
+  private:
+    uint8_t **key_data_;
+    uint32_t *key_data_len_;
+    int32_t *error_;
+};
 
 /* export_key_unsupported - the export slot of providers without an export format. */
 TEE_Result export_key_unsupported(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,

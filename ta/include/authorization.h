@@ -27,10 +27,17 @@ struct use_log_entry_t {
     TEE_Time rate_limit_end;
 };
 
-/* The use log (kUseLogEntries entries) and time anchors, owned by authorizaiton_init. */
-extern use_log_entry_t *use_log;
-extern TEE_Time system_time_at_init;
-extern TEE_Time ree_time_at_init;
+/*
+ * use_log_init - allocates the zeroed use log of kUseLogEntries entries;
+ * TEE_ERROR_OUT_OF_MEMORY (logged) when the heap is exhausted.
+ * use_log_release wipes and frees it. Both belong to authorizaiton_init
+ * and authorization_deinit.
+ */
+TEE_Result use_log_init();
+/* use_log_release - see use_log_init. */
+void use_log_release();
+/* time_anchors_init - records the TEE system time and REE time that get_wall_time starts from. */
+void time_anchors_init();
 
 /*
  * check_app_id_and_app_data - 0 when the caller's application id and data
@@ -49,13 +56,35 @@ TEE_Result authorize_begin(const uint8_t *key_id, uint32_t key_id_len, uint32_t 
                            keymaster_key_param_set_t *in_params, const keymaster_key_param_set_t *key_params,
                            int32_t *error);
 
-/* authorize_update_or_finish - per-operation user authentication; always TEE_SUCCESS. */
-TEE_Result authorize_update_or_finish(keymaster_key_param_set_t *in_params, const operation_t *op,
-                                      uint64_t challenge, int32_t *error);
+/*
+ * authorize_update_or_finish - per-operation user authentication of op's
+ * key with the handle as challenge: *error 0, -38 (bad token or key
+ * configuration) or -26 (not authenticated). Always TEE_SUCCESS.
+ */
+TEE_Result authorize_update_or_finish(keymaster_key_param_set_t *in_params, const operation_t *op, uint64_t challenge,
+                                      int32_t *error);
 
+/*
+ * check_use_count_and_add - counts one use of the key against max_uses: 0
+ * when allowed and counted; 1 with *error set when the key is used up
+ * (-56), the use log has no room for it (-31) or the key cannot be
+ * identified (-41).
+ */
 uint32_t check_use_count_and_add(const uint8_t *key_id, uint32_t key_id_len, uint32_t max_uses, int32_t *error);
+/*
+ * rate_limit_record - stamps the key's last use now and its window's end
+ * min_seconds later; 0 when stamped, 1 when the use log has no room or the
+ * key cannot be identified.
+ */
 uint32_t rate_limit_record(const uint8_t *key_id, uint32_t key_id_len, uint32_t min_seconds);
+/* rate_limit_last_use's answer when the key could not be identified: the caller must refuse. */
+constexpr uint32_t kRateLimitUnknown = 2;
+/*
+ * rate_limit_last_use - 0 and *last_use when the key has an entry, 1 when
+ * it has none, kRateLimitUnknown when its identifier could not be computed.
+ */
 uint32_t rate_limit_last_use(const uint8_t *key_id, uint32_t key_id_len, TEE_Time *last_use);
+/* get_wall_time - the REE time at start advanced by the TEE system time elapsed since. */
 void get_wall_time(TEE_Time *time);
 
 #endif

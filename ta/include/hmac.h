@@ -8,6 +8,11 @@
 #include "algorithm_provider.h"
 #include "keymaster_defs.h"
 
+/*
+ * hmac_generate_key / hmac_import_key - the provider's key slots: the
+ * parameters are checked and completed (origin, key size), the key data
+ * returned in a buffer the caller frees. Refusals set *error.
+ */
 TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                              int32_t *error);
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
@@ -38,20 +43,31 @@ struct hmac_operation_t {
 using hmac_sign_operation_t = hmac_operation_t;
 using hmac_verify_operation_t = hmac_operation_t;
 
-
-/* hmac_operation_create - builds a keyed MAC operation record; null with *error on failure. */
+/*
+ * hmac_operation_create - a record of fns's kind holding the key and a
+ * keyed, initialised MAC operation; the requested MAC length comes from
+ * in_params. Null on failure, with *error set where the failure is the
+ * caller's and out_params released.
+ */
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
-                                   keymaster_key_param_set_t *out_params, int32_t *error,
-                                   const operation_fns_t *fns, const char *func);
-/* hmac_operation_update - feeds the whole input to the MAC. */
+                                   keymaster_key_param_set_t *out_params, int32_t *error, const operation_fns_t *fns,
+                                   const char *func);
+/* hmac_operation_update - feeds the whole input to the MAC; nothing is output. Always TEE_SUCCESS. */
 TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
                                  int32_t *error);
-/* hmac_operation_mac - finishes the MAC into mac (64 bytes); *mac_len its length. */
-TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_len, int32_t *error,
-                              const char *func);
-/* hmac_operation_free - releases the record, its key and its TEE operation. */
-void hmac_operation_free(operation_t *op, const char *record_name, const char *func);
+/*
+ * hmac_operation_mac - finishes the MAC into mac (64 bytes); *mac_len its
+ * length. A TEE failure is returned; a MAC shorter than the requested
+ * length sets *error -1000.
+ */
+TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_len, int32_t *error, const char *func);
+/*
+ * hmac_operation_release - the release slot of both HMAC tables: frees
+ * the key and the TEE operation, each required of a complete record.
+ */
+void hmac_operation_release(operation_t *op, bool audit);
 
+/* create_hmac_sign / create_hmac_verify - the create slots of the HMAC sign and verify tables. */
 operation_t *create_hmac_sign(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
                               keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
                               int32_t *error);

@@ -197,8 +197,8 @@ struct key_param_t {
     uint32_t tag;
     uint32_t unused;
     union {
-        uint32_t enumerated; /* KM_ENUM, KM_ENUM_REP */
-        uint32_t integer;    /* KM_UINT, KM_UINT_REP */
+        uint32_t enumerated;   /* KM_ENUM, KM_ENUM_REP */
+        uint32_t integer;      /* KM_UINT, KM_UINT_REP */
         uint64_t long_integer; /* KM_ULONG, KM_ULONG_REP */
         uint64_t date_time;    /* KM_DATE */
         uint8_t boolean;       /* KM_BOOL */
@@ -222,7 +222,9 @@ struct keymaster_key_param_set_t {
     uint32_t length;
 };
 
-inline uint32_t key_tag_type(uint32_t tag) { return tag & 0xF0000000u; }
+inline uint32_t key_tag_type(uint32_t tag) {
+    return tag & 0xF0000000u;
+}
 
 inline bool key_tag_is_blob(uint32_t tag) {
     uint32_t t = key_tag_type(tag);
@@ -325,21 +327,31 @@ inline key_param_t key_param_bool(uint32_t tag) {
 }
 
 /*
- * _keymaster_dump_key_param_set - writes the set to the debug log, naming
+ * keymaster_dump_key_param_set - writes the set to the debug log, naming
  * the caller's file and line. Byte strings show only their length.
  */
-void _keymaster_dump_key_param_set(const char *file, int line, const keymaster_key_param_set_t *set);
-#define KM_DUMP_PARAM_SET(set) _keymaster_dump_key_param_set(__FILE_NAME__, __LINE__, (set))
+void keymaster_dump_key_param_set(const char *file, int line, const keymaster_key_param_set_t *set);
+#define KM_DUMP_PARAM_SET(set) keymaster_dump_key_param_set(__FILE_NAME__, __LINE__, (set))
+
+/*
+ * settle_error - the common exit of a command or provider step: a failure
+ * (done false) that set neither a TEE result nor an error becomes
+ * KM_ERROR_UNKNOWN_ERROR, so that no failure ever reads as success.
+ */
+inline void settle_error(TEE_Result res, bool done, int32_t *error) {
+    if (!done && res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        *error = KM_ERROR_UNKNOWN_ERROR;
+}
 
 /* param_set_guard - releases the set it watches when the scope ends. */
 class param_set_guard {
-public:
+  public:
     explicit param_set_guard(keymaster_key_param_set_t *set) : set_(set) {}
     ~param_set_guard() { key_param_set_release(set_); }
     param_set_guard(const param_set_guard &) = delete;
     param_set_guard &operator=(const param_set_guard &) = delete;
 
-private:
+  private:
     keymaster_key_param_set_t *set_;
 };
 

@@ -5,6 +5,7 @@
 #ifndef MARSHAL_H
 #define MARSHAL_H
 
+#include "byte_io.h"
 #include "keymaster_defs.h"
 
 /* is_hidden_param - application id, application data and root of trust: kept in blobs only. */
@@ -25,6 +26,16 @@ uint32_t marshal_size(const keymaster_key_param_set_t *set, bool include_hidden)
  * caller's buffer only forgotten).
  */
 TEE_Result marshal(const keymaster_key_param_set_t *set, bool include_hidden, uint8_t **buf, uint32_t *len);
+
+/*
+ * marshal_lv - writes u32 length + the serialized set (hidden parameters
+ * left out) at the writer's position, into what remains of its buffer.
+ * *written (if given) is the set's length. A length word that does not fit
+ * logs "Too short input" and fails with TEE_ERROR_GENERIC; a marshal
+ * failure logs "Marshal failed" in the caller's name and returns its result.
+ */
+TEE_Result marshal_lv(byte_writer *w, const keymaster_key_param_set_t *set, uint32_t *written,
+                      const char *func = __builtin_FUNCTION());
 
 /*
  * unmarshal - parses in into set, which must be empty. On success set owns

@@ -23,12 +23,29 @@ void operation_pool_remove(uint32_t handle);
 /* operation_pool_end_all - ends every live operation (instance teardown). */
 void operation_pool_end_all();
 
-TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
-                 int32_t *error, uint32_t *handle);
-TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
-                  int32_t *error, uint32_t *consumed);
-TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
-                  int32_t *error);
-TEE_Result _abort(uint32_t handle, int32_t *error);
+/*
+ * begin - command 16: opens the blob, authorizes the use, builds the
+ * operation and parks it. Success: *handle the new handle, out the
+ * serialized output parameters (*out_len their length), *error 0. A
+ * refusal is TEE_SUCCESS with *error set; a malformed request a TEE
+ * result. Nothing is kept on failure.
+ */
+TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
+                 uint32_t *handle);
+/*
+ * update - command 17: feeds data to the operation of handle; *consumed
+ * the input taken, out and *out_len what the operation wrote. Any failure
+ * after the handle was found ends the operation.
+ */
+TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
+                  uint32_t *consumed);
+/*
+ * finish - command 18: the operation's output and output parameters into
+ * out (u32 length + output, u32 length + parameters). Always ends the
+ * operation once its handle was found.
+ */
+TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error);
+/* abort_operation - command 23 ("_abort"): ends the operation of handle; *error -28 when there is none. */
+TEE_Result abort_operation(uint32_t handle, int32_t *error);
 
 #endif

@@ -11,6 +11,11 @@
 constexpr uint32_t kRsaMaxKeyBits = 8192;
 constexpr uint32_t kRsaComponents = 8;
 
+/*
+ * rsa_generate_key / rsa_import_key - the provider's key slots: the
+ * parameters are checked and completed (origin, key size, exponent), the
+ * key data returned in a buffer the caller frees. Refusals set *error.
+ */
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error);
 TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
@@ -27,21 +32,29 @@ TEE_Result rsa_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, 
                                 uint32_t *key_size, int32_t *error);
 
 /*
- * rsa_sign_operation_t / rsa_verify_operation_t - one layout for both: the
- * RSA operation, the digest operation (none for unhashed signatures), the
- * key, the message buffer (key size / 8 bytes: the unhashed message or the
- * final digest), and the SOTER raw-message buffer of signing records.
+ * rsa_operation_t - what every RSA record holds: the RSA operation, the
+ * key object, a buffer of one block (key size / 8 bytes: the unhashed
+ * message, the final digest or the input to encrypt or decrypt) and how
+ * much of it is used, and the begin parameters.
  */
-struct rsa_signature_operation_t {
+struct rsa_operation_t {
     operation_t header;
     TEE_OperationHandle operation;
-    TEE_OperationHandle digest_operation;
     TEE_ObjectHandle key;
-    uint8_t *message;
-    uint32_t message_len;
+    uint8_t *block;
+    uint32_t block_len;
     uint32_t digest;
     uint32_t padding;
     uint32_t key_size;
+};
+
+/*
+ * rsa_sign_operation_t / rsa_verify_operation_t - one layout for both: the
+ * digest operation (none for unhashed signatures) and the SOTER
+ * raw-message buffer of signing records.
+ */
+struct rsa_signature_operation_t : rsa_operation_t {
+    TEE_OperationHandle digest_operation;
     uint8_t *soter_buf;
     uint32_t soter_capacity;
     uint32_t soter_len;
@@ -50,39 +63,73 @@ using rsa_sign_operation_t = rsa_signature_operation_t;
 using rsa_verify_operation_t = rsa_signature_operation_t;
 
 /* rsa_encrypt_operation_t / rsa_decrypt_operation_t - the whole input, one block at most. */
-struct rsa_cipher_operation_t {
-    operation_t header;
-    TEE_OperationHandle operation;
-    TEE_ObjectHandle key;
-    uint8_t *input;
-    uint32_t input_len;
-    uint32_t digest;
-    uint32_t padding;
-    uint32_t key_size;
-};
+struct rsa_cipher_operation_t : rsa_operation_t {};
 using rsa_encrypt_operation_t = rsa_cipher_operation_t;
 using rsa_decrypt_operation_t = rsa_cipher_operation_t;
 
-/* Shared cores of the twin files. */
+/*
+ * Shared cores of the twin files.
+ *
+ * rsa_signature_create / rsa_cipher_create - a record of fns's kind for
+ * the begin parameters: key object, one-block buffer, TEE operation (and
+ * digest operation). Null on failure, with *error set where the caller
+ * is at fault; a TEE failure sets none.
+ */
 operation_t *rsa_signature_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                   bool signing, int32_t *error, const operation_fns_t *fns, const char *func);
+operation_t *rsa_cipher_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                               uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func);
+/* rsa_signature_buffer - feeds the digest, or buffers unhashed input up to its limit (-21 past it). */
 TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *input, uint32_t *input_len,
                                 int32_t *error, const char *verb, const char *func);
 /* rsa_signature_digest - finishes the digest into the message buffer. */
 TEE_Result rsa_signature_digest(rsa_signature_operation_t *op, const char *func);
 /* rsa_signature_block - turns the buffered message into the k-byte block signed without a digest. */
 void rsa_signature_block(rsa_signature_operation_t *op);
-void rsa_signature_free(operation_t *op, const char *record_name, bool soter, const char *func);
+/*
+ * rsa_operation_release - the release slot of the encrypt and decrypt
+ * tables: key object, RSA operation and block buffer, each required of a
+ * complete record. rsa_signature_release adds the signature twins' digest
+ * operation and SOTER buffer, both optional.
+ */
+void rsa_operation_release(operation_t *op, bool audit);
+void rsa_signature_release(operation_t *op, bool audit);
 
-operation_t *rsa_cipher_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
-                               uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func);
+/* rsa_cipher_update - buffers input up to one block (-21 past it); nothing is output. */
 TEE_Result rsa_cipher_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
                              int32_t *error, const char *verb, const char *func);
-void rsa_cipher_free(operation_t *op, const char *record_name, const char *func);
+
+/*
+ * rsa_output_alloc - the key-size output buffer of a finish; false, with
+ * "Out of memory" logged in the caller's name and *error -41, when the
+ * heap is exhausted.
+ */
+bool rsa_output_alloc(heap_buf *out, uint32_t key_size, int32_t *error, const char *func = __builtin_FUNCTION());
+
+/* The raw RSA calls of the finishes, each with its own failure text. */
+enum class rsa_raw_call : uint8_t { encrypt, decrypt, sign };
+
+/*
+ * rsa_raw - runs one raw RSA call of op's operation over in into out
+ * (capacity key size / 8; *out_len the bytes written, which for raw
+ * results come without leading zeros). An input the key cannot take (TEE_ERROR_BAD_PARAMETERS) is
+ * *error -38 with TEE_SUCCESS and no log; any other failure is logged
+ * in the caller's name and returned.
+ */
+TEE_Result rsa_raw(rsa_operation_t *op, rsa_raw_call call, const uint8_t *in, uint32_t in_len, uint8_t *out,
+                   uint32_t *out_len, int32_t *error, const char *func = __builtin_FUNCTION());
+
+/*
+ * rsa_left_pad - a raw RSA result of *len bytes in a buffer of key_size/8
+ * bytes, which come back without leading zeros, regains them: *len becomes
+ * key_size/8.
+ */
+void rsa_left_pad(uint8_t *out, uint32_t *len, uint32_t key_size);
 
 /* The digest's length in bytes (KM_DIGEST_MD5..SHA_2_512), 0 otherwise. */
 uint32_t rsa_digest_length(uint32_t digest);
 
+/* create_rsa_sign, create_rsa_verify, create_rsa_encrypt, create_rsa_decrypt - the create slots of the four tables. */
 operation_t *create_rsa_sign(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
                              keymaster_key_param_set_t *, int32_t *);
 operation_t *create_rsa_verify(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,

@@ -12,11 +12,6 @@ struct evp_md_st;
 // md_for - OpenSSL's digest for a Keymaster digest (MD5 to SHA-512), null otherwise.
 const evp_md_st *md_for(uint32_t digest);
 
-struct Outcome {
-    TEE_Result res;
-    int32_t error;
-    bool ok() const { return res == TEE_SUCCESS && error == 0; }
-};
 
 // The three-field key reference of the characteristics and export commands.
 Bytes key_reference(const Bytes &blob, const Bytes &app_id = {}, const Bytes &app_data = {});

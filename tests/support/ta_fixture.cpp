@@ -131,20 +131,31 @@ std::string TaTest::dump_log() const {
     return s;
 }
 
-int sweep_allocations(const std::function<void()> &setup, const std::function<TEE_Result()> &step,
-                      const std::function<void(int n, TEE_Result res)> &check) {
+std::ostream &operator<<(std::ostream &os, const Outcome &o) {
+    char buf[48];
+    std::snprintf(buf, sizeof buf, "{0x%08x, %d}", static_cast<unsigned>(o.res), static_cast<int>(o.error));
+    return os << buf;
+}
+
+int sweep_allocations(const std::string &what, const std::function<void()> &setup,
+                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed) {
+    const size_t base = tee_host::heap::stats().live_count;
     for (int n = 1;; ++n) {
         if (setup)
             setup();
         tee_host::heap::fail_nth(static_cast<uint64_t>(n));
-        TEE_Result res = step();
-        bool fired = tee_host::heap::injected_failure_fired();
+        const Outcome o = step();
+        const bool fired = tee_host::heap::injected_failure_fired();
         tee_host::heap::fail_nth(0);
         if (!fired)
             return n - 1;
-        check(n, res);
+        bool expected = false;
+        for (const Outcome &a : allowed)
+            expected = expected || a == o;
+        EXPECT_TRUE(expected) << what << ": failure point " << n << " ended in " << o;
+        EXPECT_EQ(tee_host::heap::stats().live_count, base) << what << ": failure point " << n << " leaked";
         if (n > 10000) {
-            ADD_FAILURE() << "allocation sweep does not end";
+            ADD_FAILURE() << what << ": allocation sweep does not end";
             return n;
         }
     }

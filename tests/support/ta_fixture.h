@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <ostream>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -70,11 +71,23 @@ protected:
     uint32_t session_ = 0;
 };
 
-// sweep_allocations - runs `step` with the 1st, 2nd, ... allocation failing
-// until a run fires no failure; `check` sees each failed run's outcome.
-// Returns the number of failure points visited.
-int sweep_allocations(const std::function<void()> &setup, const std::function<TEE_Result()> &step,
-                      const std::function<void(int n, TEE_Result res)> &check);
+// A command's two result channels: the TEE result and the Keymaster error in a.
+struct Outcome {
+    TEE_Result res;
+    int32_t error;
+    bool ok() const { return res == TEE_SUCCESS && error == 0; }
+    bool operator==(const Outcome &o) const { return res == o.res && error == o.error; }
+};
+std::ostream &operator<<(std::ostream &os, const Outcome &o);
+
+// sweep_allocations - fails the 1st, 2nd, ... TA heap allocation of `step`
+// in turn (after `setup`, which may be null) until a run fires no failure.
+// Every run whose failure fired must end in one of `allowed`, and with as
+// many live TA heap blocks as before the sweep: step ends whatever it and
+// setup began. Reports each violation with `what` and the failure point;
+// returns the number of failure points visited.
+int sweep_allocations(const std::string &what, const std::function<void()> &setup,
+                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed);
 
 Bytes hex(std::string_view s);
 std::string to_hex(const uint8_t *p, size_t n);
