@@ -49,13 +49,6 @@ public:
 
 namespace detail {
 struct Globals;
-// rsa_cache_clear - frees (and so wipes) every prepared RSA key the
-// platform holds and zeroes the cache's counters; the Tee calls it as it
-// shuts down.
-void rsa_cache_clear();
-// mac_cache_clear - frees every keyed HMAC context the platform keeps and
-// wipes the keys it held; called when the Tee shuts down.
-void mac_cache_clear();
 }
 
 class Tee {
@@ -151,17 +144,25 @@ void script(const std::vector<uint8_t> &bytes);
 size_t scripted_left();
 } // namespace rng
 
-// Prepared RSA keys: the platform keeps the last few keys it prepared for
-// operations (in its own memory, never the TA's), so that a key populated
-// again with the same components skips OpenSSL's per-key set-up.
-namespace rsa_cache {
-struct Stats {
-    uint64_t hits;   // preparations served from the cache since the Tee started
-    uint64_t misses; // keys prepared anew
-    size_t size;     // keys held now
+// Prepared asymmetric keys: the live Tee keeps the last few RSA and EC keys
+// it prepared (in its own memory, never the TA's), so that a key populated
+// again with the same components skips OpenSSL's per-key set-up and, for
+// EC, the checks made when the key was first populated. Each cache starts
+// empty with its Tee and is wiped when the Tee ends; with no Tee alive the
+// counters read zero.
+struct PreparedKeyStats {
+    uint64_t hits = 0;   // preparations served from the cache since the Tee started
+    uint64_t misses = 0; // keys prepared anew (EC: populated or generated keys first seen)
+    size_t size = 0;     // keys held now
 };
+namespace rsa_cache {
+using Stats = PreparedKeyStats;
 Stats stats();
 } // namespace rsa_cache
+namespace ec_cache {
+using Stats = PreparedKeyStats;
+Stats stats();
+} // namespace ec_cache
 
 // Trace lines as the TA emitted them.
 namespace trace {
@@ -193,5 +194,69 @@ size_t live_operations();
 // and freed then.
 size_t leaked_at_last_destroy();
 } // namespace tee_host::handles
+
+// The provisioning TA: the device's factory store of SOTER material (the
+// attestation key pair, the SOTER property set, the CPU identifier) and
+// its device identifier, answering the Keymaster TA's requests over a
+// TA-to-TA session. Every Tee installs it under kProvisioningTaUuid.
+namespace tee_host {
+
+extern const TEE_UUID kProvisioningTaUuid;
+
+namespace provisioning {
+
+// FactoryData - what the factory step stores. RSA components are unsigned
+// big-endian; the five CRT values come all together or not at all. The
+// fingerprint TA UUID is stored in the TEE's in-memory UUID layout.
+struct FactoryData {
+    std::vector<uint8_t> n, e, d, p, q, dp, dq, qinv;
+    std::string sensor_name;
+    std::string sensor_version;
+    TEE_UUID fp_ta_uuid{};
+    std::string cpu_id; // at most 64 bytes
+};
+
+enum class StoreResult { stored, already_provisioned, invalid, io_error };
+
+// store - writes the factory data into state_dir, atomically (a crash
+// leaves the old store or the new one). already_provisioned, with nothing
+// written, when a store exists and force is false; invalid when a value
+// does not fit its field (a component or text over 65535 bytes, a CPU
+// identifier over 64, some but not all CRT values).
+StoreResult store(const std::filesystem::path &state_dir, const FactoryData &data, bool force);
+// provisioned - whether state_dir holds a factory store.
+bool provisioned(const std::filesystem::path &state_dir);
+
+// The requests the provisioning TA answers.
+enum class Request { key, data, soter_properties, cpu_id, device_id };
+
+// Answer - what a request gets instead of the store's answer: an error, or
+// (with result TEE_SUCCESS) these bytes, subject to the caller's buffer.
+struct Answer {
+    TEE_Result result = TEE_SUCCESS;
+    std::vector<uint8_t> bytes;
+};
+
+// answer_next - the next request of this kind gets `answer` (answers queue
+// up); answer_always - every later one does, once the queue is empty.
+void answer_next(Request request, Answer answer);
+void answer_always(Request request, Answer answer);
+// reset - back to answering from the store, counts cleared. A new Tee starts reset.
+void reset();
+// served - the requests of this kind answered since the last reset.
+size_t served(Request request);
+
+// The answers built from factory data, as the store gives them.
+std::vector<uint8_t> key_answer(const FactoryData &data);
+std::vector<uint8_t> soter_property_answer(const FactoryData &data);
+
+} // namespace provisioning
+
+namespace detail {
+// make_provisioning_ta - the provisioning TA on a state directory; the Tee installs it at start.
+std::shared_ptr<NativeTa> make_provisioning_ta(const std::filesystem::path &state_dir);
+} // namespace detail
+
+} // namespace tee_host
 
 #endif // TEE_HOST_H

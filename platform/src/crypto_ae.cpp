@@ -10,22 +10,17 @@
 #include <openssl/core_names.h>
 #include <openssl/params.h>
 
+#include "crypto_state.h"
 #include "operation_internal.h"
 
 namespace tee_host::detail {
 namespace {
 
-constexpr uint32_t kMinTagBits = 32;
+// The tag lengths GP gives GCM: 96 to 128 bits in whole bytes.
+constexpr uint32_t kMinTagBits = 96;
 constexpr uint32_t kMaxTagBits = 128;
-constexpr uint32_t kMaxNonce = 128; // the backend's limit
-
-// Fetched once per key size, not at every Init.
-EVP_CIPHER *shared_gcm(uint32_t bits) {
-    static EVP_CIPHER *c128 = EVP_CIPHER_fetch(nullptr, "AES-128-GCM", nullptr);
-    static EVP_CIPHER *c192 = EVP_CIPHER_fetch(nullptr, "AES-192-GCM", nullptr);
-    static EVP_CIPHER *c256 = EVP_CIPHER_fetch(nullptr, "AES-256-GCM", nullptr);
-    return bits == 128 ? c128 : bits == 192 ? c192 : bits == 256 ? c256 : nullptr;
-}
+constexpr uint32_t kMaxNonce = 128;  // the backend's limit
+constexpr size_t kDefaultNonce = 12; // GCM's own; no length to announce
 
 class AeEngine final : public Engine {
 public:
@@ -61,19 +56,29 @@ public:
 
     void init(const SecretBytes &key, const uint8_t *nonce, size_t nonce_len, size_t tag_len, bool encrypt) {
         reset();
-        // Kept by the engine: the context holds no reference of its own.
-        EVP_CIPHER_free(cipher_);
-        cipher_ = shared_gcm(static_cast<uint32_t>(key.size() * 8));
-        if (cipher_ && EVP_CIPHER_up_ref(cipher_) != 1)
-            cipher_ = nullptr;
+        // The Tee fetched the cipher once; the engine holds a reference of
+        // its own for as long as its context may use it.
+        EVP_CIPHER *wanted = aes_cipher(static_cast<uint32_t>(key.size() * 8), AesMode::Gcm);
+        if (wanted != cipher_) {
+            if (!wanted || EVP_CIPHER_up_ref(wanted) != 1)
+                panic("the AE backend failed to start");
+            EVP_CIPHER_free(cipher_);
+            cipher_ = wanted;
+        }
         int enc = encrypt ? 1 : 0;
-        // The nonce length must be known before the nonce is given.
-        size_t iv_len = nonce_len;
-        OSSL_PARAM params[] = {OSSL_PARAM_construct_size_t(OSSL_CIPHER_PARAM_AEAD_IVLEN, &iv_len),
-                               OSSL_PARAM_construct_end()};
-        if (!cipher_ || EVP_CipherInit_ex2(ctx_, cipher_, nullptr, nullptr, enc, nullptr) != 1 ||
-            EVP_CIPHER_CTX_set_params(ctx_, params) != 1 ||
-            EVP_CipherInit_ex2(ctx_, nullptr, key.data(), nonce, enc, nullptr) != 1)
+        bool ok = true;
+        if (nonce_len == kDefaultNonce) {
+            ok = EVP_CipherInit_ex2(ctx_, cipher_, key.data(), nonce, enc, nullptr) == 1;
+        } else {
+            // Another nonce length must be known before the nonce is given.
+            size_t iv_len = nonce_len;
+            OSSL_PARAM params[] = {OSSL_PARAM_construct_size_t(OSSL_CIPHER_PARAM_AEAD_IVLEN, &iv_len),
+                                   OSSL_PARAM_construct_end()};
+            ok = EVP_CipherInit_ex2(ctx_, cipher_, nullptr, nullptr, enc, nullptr) == 1 &&
+                 EVP_CIPHER_CTX_set_params(ctx_, params) == 1 &&
+                 EVP_CipherInit_ex2(ctx_, nullptr, key.data(), nonce, enc, nullptr) == 1;
+        }
+        if (!ok)
             panic("the AE backend failed to start");
         tag_len_ = tag_len;
     }
@@ -184,7 +189,7 @@ TEE_Result TEE_AEUpdate(TEE_OperationHandle operation, const void *srcData, uint
         return TEE_ERROR_SHORT_BUFFER;
     if (srcLen && !destData)
         panic("TEE_AEUpdate into a null buffer");
-    InputView in(srcData, srcLen, destData, *destLen, __func__);
+    InputView in(srcData, srcLen, destData, *destLen, __func__, true);
     engine(op).update(in.data(), in.size(), static_cast<uint8_t *>(destData));
     *destLen = srcLen;
     return TEE_SUCCESS;
@@ -203,7 +208,7 @@ TEE_Result TEE_AEEncryptFinal(TEE_OperationHandle operation, const void *srcData
         return TEE_ERROR_SHORT_BUFFER;
     if ((srcLen && !destData) || !tag)
         panic("TEE_AEEncryptFinal into a null buffer");
-    InputView in(srcData, srcLen, destData, *destLen, __func__);
+    InputView in(srcData, srcLen, destData, *destLen, __func__, true);
     e.update(in.data(), in.size(), static_cast<uint8_t *>(destData));
     e.encrypt_final(static_cast<uint8_t *>(tag));
     *destLen = srcLen;

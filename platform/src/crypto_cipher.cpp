@@ -2,6 +2,7 @@
  * crypto_cipher.cpp - AES in ECB and CBC without padding and in CTR mode,
  * on EVP_CIPHER. The platform never pads: a TA that wants padding does it.
  */
+#include "crypto_state.h"
 #include "operation_internal.h"
 
 namespace tee_host::detail {
@@ -11,8 +12,7 @@ constexpr size_t kBlock = 16;
 
 class CipherEngine final : public Engine {
 public:
-    CipherEngine(const char *mode, bool block_mode, EVP_CIPHER_CTX *ctx)
-        : mode_(mode), block_mode_(block_mode), ctx_(ctx) {}
+    CipherEngine(AesMode mode, EVP_CIPHER_CTX *ctx) : mode_(mode), block_mode_(mode != AesMode::Ctr), ctx_(ctx) {}
     ~CipherEngine() override {
         EVP_CIPHER_CTX_free(ctx_);
         EVP_CIPHER_free(cipher_);
@@ -34,7 +34,7 @@ public:
             EVP_CIPHER_CTX_free(ctx);
             panic("the cipher backend could not copy an operation");
         }
-        auto copy = std::make_unique<CipherEngine>(mode_, block_mode_, ctx);
+        auto copy = std::make_unique<CipherEngine>(mode_, ctx);
         copy->cipher_ = cipher_;
         copy->buffered_ = buffered_;
         return copy;
@@ -44,14 +44,23 @@ public:
 
     void init(const SecretBytes &key, const uint8_t *iv, bool encrypt) {
         reset();
-        // The context does not hold a reference to an explicitly fetched
-        // cipher, so the engine keeps one as long as the context uses it.
-        EVP_CIPHER_free(cipher_);
-        cipher_ = EVP_CIPHER_fetch(nullptr, aes_cipher_name(static_cast<uint32_t>(key.size() * 8), mode_), nullptr);
-        if (!cipher_ || EVP_CipherInit_ex2(ctx_, cipher_, key.data(), iv, encrypt ? 1 : 0, nullptr) != 1 ||
+        // The Tee fetched the cipher once; the engine holds a reference of
+        // its own for as long as its context may use it.
+        EVP_CIPHER *wanted = aes_cipher(static_cast<uint32_t>(key.size() * 8), mode_);
+        if (wanted != cipher_) {
+            if (!wanted || EVP_CIPHER_up_ref(wanted) != 1)
+                panic("the cipher backend failed to start");
+            EVP_CIPHER_free(cipher_);
+            cipher_ = wanted;
+        }
+        if (EVP_CipherInit_ex2(ctx_, cipher_, key.data(), iv, encrypt ? 1 : 0, nullptr) != 1 ||
             EVP_CIPHER_CTX_set_padding(ctx_, 0) != 1)
             panic("the cipher backend failed to start");
     }
+
+    // in_place_ok - whether input and output may share one address: EVP
+    // runs ahead of its input only while it completes a held partial block.
+    bool in_place_ok() const { return !block_mode_ || buffered_ == 0; }
 
     // output_for - the bytes an update of n more input bytes releases.
     size_t output_for(size_t n) const { return block_mode_ ? (buffered_ + n) / kBlock * kBlock : n; }
@@ -75,7 +84,7 @@ public:
     }
 
 private:
-    const char *mode_;
+    AesMode mode_;
     bool block_mode_;
     EVP_CIPHER_CTX *ctx_;
     EVP_CIPHER *cipher_ = nullptr;
@@ -87,18 +96,15 @@ CipherEngine &engine(Operation &op) { return static_cast<CipherEngine &>(*op.eng
 } // namespace
 
 TEE_Result cipher_setup(Operation &op) {
-    const char *mode = nullptr;
-    bool block_mode = true;
+    AesMode mode = AesMode::Ecb;
     switch (op.info.algorithm) {
     case TEE_ALG_AES_ECB_NOPAD:
-        mode = "ECB";
         break;
     case TEE_ALG_AES_CBC_NOPAD:
-        mode = "CBC";
+        mode = AesMode::Cbc;
         break;
     case TEE_ALG_AES_CTR:
-        mode = "CTR";
-        block_mode = false;
+        mode = AesMode::Ctr;
         break;
     default:
         return TEE_ERROR_NOT_SUPPORTED;
@@ -110,7 +116,7 @@ TEE_Result cipher_setup(Operation &op) {
     EVP_CIPHER_CTX *ctx = EVP_CIPHER_CTX_new();
     if (!ctx)
         return TEE_ERROR_OUT_OF_MEMORY;
-    op.engine = std::make_unique<CipherEngine>(mode, block_mode, ctx);
+    op.engine = std::make_unique<CipherEngine>(mode, ctx);
     op.info.requiredKeyUsage = op.info.mode == TEE_MODE_ENCRYPT ? TEE_USAGE_ENCRYPT : TEE_USAGE_DECRYPT;
     return TEE_SUCCESS;
 }
@@ -145,7 +151,7 @@ TEE_Result TEE_CipherUpdate(TEE_OperationHandle operation, const void *srcData, 
         return TEE_ERROR_SHORT_BUFFER;
     if (needed && !destData)
         panic("TEE_CipherUpdate into a null buffer");
-    InputView in(srcData, srcLen, destData, *destLen, __func__);
+    InputView in(srcData, srcLen, destData, *destLen, __func__, e.in_place_ok());
     e.update(in.data(), in.size(), static_cast<uint8_t *>(destData), needed);
     *destLen = static_cast<uint32_t>(needed);
     return TEE_SUCCESS;
@@ -167,7 +173,7 @@ TEE_Result TEE_CipherDoFinal(TEE_OperationHandle operation, const void *srcData,
         return TEE_ERROR_SHORT_BUFFER;
     if (needed && !destData)
         panic("TEE_CipherDoFinal into a null buffer");
-    InputView in(srcData, srcLen, destData, *destLen, __func__);
+    InputView in(srcData, srcLen, destData, *destLen, __func__, e.in_place_ok());
     e.update(in.data(), in.size(), static_cast<uint8_t *>(destData), needed);
     e.finish_stream();
     *destLen = static_cast<uint32_t>(needed);

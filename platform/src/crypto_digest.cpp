@@ -2,6 +2,7 @@
  * crypto_digest.cpp - message digests: MD5 and SHA-1/224/256/384/512 on
  * EVP_MD, and the table of GP hash numbers the other families share.
  */
+#include "crypto_state.h"
 #include "operation_internal.h"
 
 namespace tee_host::detail {
@@ -73,8 +74,12 @@ TEE_Result digest_setup(Operation &op) {
     if (alg < TEE_ALG_MD5 || alg > TEE_ALG_SHA512 || op.info.mode != TEE_MODE_DIGEST)
         return TEE_ERROR_NOT_SUPPORTED;
     const HashInfo *h = hash_info(alg & 0xF);
-    EVP_MD *md = EVP_MD_fetch(nullptr, h->name, nullptr);
-    EVP_MD_CTX *ctx = md ? EVP_MD_CTX_new() : nullptr;
+    // The engine holds its own reference, so an operation the TA never
+    // freed stays usable whatever happens to the Tee's state.
+    EVP_MD *md = fetched_digest(alg & 0xF);
+    if (EVP_MD_up_ref(md) != 1)
+        return TEE_ERROR_OUT_OF_MEMORY;
+    EVP_MD_CTX *ctx = EVP_MD_CTX_new();
     if (!ctx || EVP_DigestInit_ex2(ctx, md, nullptr) != 1) {
         EVP_MD_CTX_free(ctx);
         EVP_MD_free(md);

@@ -2,38 +2,20 @@
  * crypto_mac.cpp - HMAC over MD5 and SHA-1/224/256/384/512 on EVP_MAC.
  */
 #include <openssl/core_names.h>
+#include <openssl/crypto.h>
 #include <openssl/params.h>
 
-#include <cstring>
-#include <mutex>
-#include <string>
-#include <vector>
-
-#include <openssl/crypto.h>
-
+#include "crypto_state.h"
 #include "operation_internal.h"
 
 namespace tee_host::detail {
 namespace {
 
-EVP_MAC *shared_hmac() {
-    static EVP_MAC *mac = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
-    return mac;
-}
-
-// Keyed HMAC contexts by hash and key, so that a key seen again (a key-store
-// key on every blob, a key used again) skips the digest lookup and the key
-// pads. Platform memory only; wiped when the Tee shuts down.
-struct KeyedCache {
-    std::mutex mu;
-    struct Entry { const char *hash; SecretBytes key; EVP_MAC_CTX *ctx; };
-    std::vector<Entry> entries;
-    size_t next = 0;
-};
-KeyedCache &keyed_cache() { static KeyedCache c; return c; }
-
+// keyed_ctx - a new HMAC context keyed with `key` for `hash`, duplicated
+// from the Tee's keyed contexts when this key was seen lately.
 EVP_MAC_CTX *keyed_ctx(const char *hash, const SecretBytes &key) {
-    KeyedCache &c = keyed_cache();
+    CryptoState &state = crypto_state();
+    KeyedMacs &c = state.macs;
     {
         std::lock_guard<std::mutex> lock(c.mu);
         for (auto &e : c.entries)
@@ -44,15 +26,17 @@ EVP_MAC_CTX *keyed_ctx(const char *hash, const SecretBytes &key) {
         OSSL_PARAM_construct_utf8_string(OSSL_MAC_PARAM_DIGEST, const_cast<char *>(hash), 0),
         OSSL_PARAM_construct_end(),
     };
-    EVP_MAC_CTX *ctx = EVP_MAC_CTX_new(shared_hmac());
+    EVP_MAC_CTX *ctx = EVP_MAC_CTX_new(state.hmac);
     if (!ctx || EVP_MAC_init(ctx, key.data(), key.size(), params) != 1)
         panic("the MAC backend failed to start");
     EVP_MAC_CTX *tmpl = EVP_MAC_CTX_dup(ctx);
+    if (!tmpl)
+        return ctx; // not kept; the next use keys again
     std::lock_guard<std::mutex> lock(c.mu);
-    if (c.entries.size() < 8) {
+    if (c.entries.size() < KeyedMacs::kEntries) {
         c.entries.push_back({hash, key, tmpl});
     } else {
-        auto &e = c.entries[c.next++ % 8];
+        auto &e = c.entries[c.next++ % KeyedMacs::kEntries];
         EVP_MAC_CTX_free(e.ctx);
         e = {hash, key, tmpl};
     }
@@ -148,22 +132,13 @@ TEE_Result mac_setup(Operation &op) {
     if (!secret_object_type(h->hmac_type)->size_ok(max) &&
         !(max >= 8 && max <= kMaxGenericBits && max % 8 == 0))
         return TEE_ERROR_NOT_SUPPORTED;
-    EVP_MAC *mac = shared_hmac();
-    if (!mac || EVP_MAC_up_ref(mac) != 1)
+    EVP_MAC *mac = crypto_state().hmac;
+    if (EVP_MAC_up_ref(mac) != 1)
         return TEE_ERROR_OUT_OF_MEMORY;
     op.engine = std::make_unique<MacEngine>(*h, mac);
     op.info.digestLength = h->size;
     op.info.requiredKeyUsage = TEE_USAGE_MAC;
     return TEE_SUCCESS;
-}
-
-void mac_cache_clear() {
-    KeyedCache &c = keyed_cache();
-    std::lock_guard<std::mutex> lock(c.mu);
-    for (auto &e : c.entries)
-        EVP_MAC_CTX_free(e.ctx);
-    c.entries.clear(); // SecretBytes wipe the keys
-    c.next = 0;
 }
 
 } // namespace tee_host::detail

@@ -10,7 +10,7 @@
 #include <unordered_map>
 
 #include "operation_internal.h"
-#include "rsa_internal.h"
+#include "pkey_internal.h"
 
 namespace tee_host::detail {
 namespace {
@@ -20,9 +20,10 @@ struct OperationTable {
     std::unordered_map<uintptr_t, std::unique_ptr<Operation>> ops;
 };
 
+// Never destroyed, like the object table (objects.cpp).
 OperationTable &table() {
-    static OperationTable t;
-    return t;
+    static OperationTable *t = new OperationTable;
+    return *t;
 }
 
 // The operation class sits in the top nibble of every GP algorithm identifier.
@@ -42,12 +43,17 @@ TEE_Result setup_by_class(Operation &op) {
     case TEE_OPERATION_ASYMMETRIC_SIGNATURE:
     case TEE_OPERATION_KEY_DERIVATION:
         // The RSA and EC families go here, chosen by the algorithm's low
-        // byte (0x30 RSA, 0x41 ECDSA, 0x42 ECDH); their engines derive
-        // from AsymmetricEngine. TEE_MODE_EXPORT arrives with an RSA
+        // byte (0x30 RSA, 0x41 ECDSA); their engines derive from
+        // AsymmetricEngine. TEE_MODE_EXPORT arrives with an RSA
         // algorithm's class.
-        if ((op.info.algorithm & 0xFF) == 0x30)
+        switch (op.info.algorithm & 0xFF) {
+        case 0x30:
             return rsa_setup(op);
-        return TEE_ERROR_NOT_SUPPORTED;
+        case 0x41:
+            return ec_setup(op);
+        default:
+            return TEE_ERROR_NOT_SUPPORTED;
+        }
     default:
         return TEE_ERROR_NOT_SUPPORTED;
     }
@@ -137,7 +143,7 @@ bool output_fits(uint32_t *len, size_t needed, const char *fn) {
     return true;
 }
 
-InputView::InputView(const void *src, size_t len, const void *dst, size_t dst_len, const char *fn)
+InputView::InputView(const void *src, size_t len, const void *dst, size_t dst_len, const char *fn, bool in_place)
     : src_(static_cast<const uint8_t *>(src)), len_(len) {
     if (len && !src) {
         std::fprintf(stderr, "%s\n", fn);
@@ -145,7 +151,7 @@ InputView::InputView(const void *src, size_t len, const void *dst, size_t dst_le
     }
     auto s = reinterpret_cast<uintptr_t>(src);
     auto d = reinterpret_cast<uintptr_t>(dst);
-    if (len && dst && dst_len && s < d + dst_len && d < s + len)
+    if (len && dst && dst_len && s < d + dst_len && d < s + len && !(in_place && s == d))
         copy_.assign(src_, src_ + len);
 }
 
@@ -163,27 +169,6 @@ bool cipher_update(EVP_CIPHER_CTX *ctx, uint8_t *out, const uint8_t *in, size_t 
         len -= n;
     }
     return true;
-}
-
-const char *aes_cipher_name(uint32_t key_bits, const char *mode) {
-    static const char *const names[][3] = {
-        {"AES-128-ECB", "AES-128-CBC", "AES-128-CTR"},
-        {"AES-192-ECB", "AES-192-CBC", "AES-192-CTR"},
-        {"AES-256-ECB", "AES-256-CBC", "AES-256-CTR"},
-    };
-    static const char *const gcm[] = {"AES-128-GCM", "AES-192-GCM", "AES-256-GCM"};
-    int row = key_bits == 128 ? 0 : key_bits == 192 ? 1 : key_bits == 256 ? 2 : -1;
-    if (row < 0)
-        return nullptr;
-    if (!std::strcmp(mode, "ECB"))
-        return names[row][0];
-    if (!std::strcmp(mode, "CBC"))
-        return names[row][1];
-    if (!std::strcmp(mode, "CTR"))
-        return names[row][2];
-    if (!std::strcmp(mode, "GCM"))
-        return gcm[row];
-    return nullptr;
 }
 
 TEE_Result AsymmetricEngine::encrypt(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t,
@@ -321,6 +306,8 @@ TEE_Result TEE_SetOperationKey(TEE_OperationHandle operation, TEE_ObjectHandle k
         panic("TEE_SetOperationKey with an uninitialized key object");
     if (!op.engine->accepts_key(obj.type))
         panic("TEE_SetOperationKey with a key of the wrong type");
+    if (!op.engine->accepts_key_size(obj.key_size))
+        panic("TEE_SetOperationKey with a key of the wrong size for the algorithm");
     if (obj.key_size > op.info.maxKeySize)
         panic("TEE_SetOperationKey with a key larger than the operation's maximum");
     if ((obj.usage & op.info.requiredKeyUsage) != op.info.requiredKeyUsage)

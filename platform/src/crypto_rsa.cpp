@@ -11,11 +11,9 @@
  * components.
  */
 #include <algorithm>
-#include <array>
 #include <climits>
 #include <cstdio>
 #include <cstring>
-#include <mutex>
 #include <vector>
 
 #include <openssl/bn.h>
@@ -25,7 +23,8 @@
 #include <openssl/params.h>
 #include <openssl/x509.h>
 
-#include "rsa_internal.h"
+#include "crypto_state.h"
+#include "pkey_internal.h"
 
 namespace tee_host {
 namespace detail {
@@ -61,54 +60,7 @@ constexpr Component kComponents[] = {
     {TEE_ATTR_RSA_COEFFICIENT, OSSL_PKEY_PARAM_RSA_COEFFICIENT1, true},
 };
 
-struct BnFree {
-    void operator()(BIGNUM *b) const { BN_clear_free(b); }
-};
-using Bn = std::unique_ptr<BIGNUM, BnFree>;
-struct BnCtxFree {
-    void operator()(BN_CTX *c) const { BN_CTX_free(c); }
-};
-using BnCtx = std::unique_ptr<BN_CTX, BnCtxFree>;
-struct PkeyCtxFree {
-    void operator()(EVP_PKEY_CTX *c) const { EVP_PKEY_CTX_free(c); }
-};
-using PkeyCtx = std::unique_ptr<EVP_PKEY_CTX, PkeyCtxFree>;
-struct PkeyFree {
-    void operator()(EVP_PKEY *k) const { EVP_PKEY_free(k); }
-};
-using Pkey = std::unique_ptr<EVP_PKEY, PkeyFree>;
-struct ParamBldFree {
-    void operator()(OSSL_PARAM_BLD *b) const { OSSL_PARAM_BLD_free(b); }
-};
-struct ParamFree {
-    void operator()(OSSL_PARAM *p) const { OSSL_PARAM_free(p); }
-};
-
 bool rsa_size_ok(uint32_t bits) { return bits >= kMinBits && bits <= kMaxBits && bits % 8 == 0; }
-
-// strip_leading_zeros - b as the shortest big-endian form of its integer.
-void strip_leading_zeros(SecretBytes &b) {
-    auto first = std::find_if(b.begin(), b.end(), [](uint8_t x) { return x != 0; });
-    b.erase(b.begin(), first);
-}
-
-// to_bn - the integer in big-endian bytes, in memory OpenSSL wipes when freed.
-Bn to_bn(const uint8_t *p, size_t n) {
-    Bn bn(BN_secure_new());
-    if (!bn || !BN_bin2bn(p, static_cast<int>(n), bn.get()))
-        panic("the RSA backend is out of memory");
-    return bn;
-}
-Bn to_bn(const SecretBytes &b) { return to_bn(b.data(), b.size()); }
-Bn new_bn() { return to_bn(nullptr, 0); }
-Bn attr_bn(const AttributeMap &attrs, uint32_t id) { return to_bn(attrs.at(id).bytes); }
-
-// from_bn - the integer as minimal unsigned big-endian bytes.
-SecretBytes from_bn(const BIGNUM *bn) {
-    SecretBytes out(static_cast<size_t>(BN_num_bytes(bn)));
-    BN_bn2bin(bn, out.data());
-    return out;
-}
 
 // --- Key objects -----------------------------------------------------------------
 
@@ -223,92 +175,28 @@ TEE_Result pair_generate(AttributeMap &attrs, uint32_t bits, const TEE_Attribute
     if (bits < kMinGenerateBits)
         return TEE_ERROR_NOT_SUPPORTED;
 
-    std::unique_ptr<OSSL_PARAM_BLD, ParamBldFree> bld(OSSL_PARAM_BLD_new());
+    ParamBld bld(OSSL_PARAM_BLD_new());
     if (!bld || !OSSL_PARAM_BLD_push_size_t(bld.get(), OSSL_PKEY_PARAM_RSA_BITS, bits) ||
         !OSSL_PARAM_BLD_push_BN(bld.get(), OSSL_PKEY_PARAM_RSA_E, e.get()))
         panic("the RSA backend is out of memory");
-    std::unique_ptr<OSSL_PARAM, ParamFree> gen_params(OSSL_PARAM_BLD_to_param(bld.get()));
-    PkeyCtx ctx(EVP_PKEY_CTX_new_from_name(nullptr, "RSA", nullptr));
-    EVP_PKEY *raw = nullptr;
-    if (!gen_params || !ctx || EVP_PKEY_keygen_init(ctx.get()) != 1 ||
-        EVP_PKEY_CTX_set_params(ctx.get(), gen_params.get()) != 1 || EVP_PKEY_generate(ctx.get(), &raw) != 1)
-        panic("the RSA backend failed to generate a key");
-    Pkey pkey(raw);
-    for (const Component &c : kComponents) {
-        BIGNUM *bn = nullptr;
-        if (EVP_PKEY_get_bn_param(pkey.get(), c.param, &bn) != 1)
-            panic("the RSA backend generated an incomplete key");
-        Bn owned(bn);
-        attrs[c.attr].bytes = from_bn(owned.get());
-    }
+    Pkey pkey = pkey_generate("RSA", bld.get());
+    for (const Component &c : kComponents)
+        attrs[c.attr].bytes = from_bn(pkey_bn(pkey.get(), c.param).get());
     return TEE_SUCCESS;
 }
 
 const ObjectTypeOps kRsaTypes[] = {
-    {TEE_TYPE_RSA_KEYPAIR, kPairRequired, kCrtAttrs, rsa_size_ok, pair_key_bits, pair_generate},
-    // A public key is never generated on its own: GP generates key pairs.
-    {TEE_TYPE_RSA_PUBLIC_KEY, kPublicRequired, {}, rsa_size_ok, public_key_bits,
-     [](AttributeMap &, uint32_t, const TEE_Attribute *, uint32_t) -> TEE_Result {
-         return TEE_ERROR_NOT_SUPPORTED;
-     }},
+    {TEE_TYPE_RSA_KEYPAIR, kPairRequired, kCrtAttrs, rsa_size_ok, pair_key_bits, pair_generate, true},
+    {TEE_TYPE_RSA_PUBLIC_KEY, kPublicRequired, {}, rsa_size_ok, public_key_bits, generate_public_key, true},
 };
 
 // --- Prepared keys -----------------------------------------------------------------
-
-using KeyId = std::array<uint8_t, 32>;
-
-struct CacheEntry {
-    KeyId id;
-    EVP_PKEY *pkey;
-};
-
-struct Cache {
-    std::mutex mu;
-    std::vector<CacheEntry> entries; // most recently used first
-    uint64_t hits = 0;
-    uint64_t misses = 0;
-};
-
-constexpr size_t kCacheEntries = 8;
-
-Cache &cache() {
-    static Cache c;
-    return c;
-}
-
-// drop - releases the cache's reference to an entry and wipes its ID.
-void drop(CacheEntry &e) {
-    EVP_PKEY_free(e.pkey); // OpenSSL clears the private components as it frees them
-    OPENSSL_cleanse(e.id.data(), e.id.size());
-}
-
-// key_id - SHA-256 over the object type and every component (ID, length,
-// bytes). Components are minimal, so equal keys give equal IDs.
-KeyId key_id(const Object &obj) {
-    EVP_MD_CTX *ctx = EVP_MD_CTX_new();
-    auto add_u32 = [ctx](uint32_t v) {
-        uint8_t b[4] = {static_cast<uint8_t>(v >> 24), static_cast<uint8_t>(v >> 16), static_cast<uint8_t>(v >> 8),
-                        static_cast<uint8_t>(v)};
-        return EVP_DigestUpdate(ctx, b, sizeof b) == 1;
-    };
-    bool ok = ctx && EVP_DigestInit_ex(ctx, EVP_sha256(), nullptr) == 1 && add_u32(obj.type);
-    for (const auto &[id, attr] : obj.attrs)
-        ok = ok && add_u32(id) && add_u32(static_cast<uint32_t>(attr.bytes.size())) &&
-             EVP_DigestUpdate(ctx, attr.bytes.data(), attr.bytes.size()) == 1;
-    KeyId out{};
-    unsigned int len = 0;
-    ok = ok && EVP_DigestFinal_ex(ctx, out.data(), &len) == 1 && len == out.size();
-    EVP_MD_CTX_free(ctx);
-    if (!ok)
-        panic("the RSA backend failed to identify a key");
-    return out;
-}
 
 // build_pkey - a new EVP_PKEY (owned by the caller) from the object's
 // components, which key_bits has already checked.
 EVP_PKEY *build_pkey(const Object &obj) {
     bool pair = obj.type == TEE_TYPE_RSA_KEYPAIR;
-    std::unique_ptr<OSSL_PARAM_BLD, ParamBldFree> bld(OSSL_PARAM_BLD_new());
+    ParamBld bld(OSSL_PARAM_BLD_new());
     if (!bld)
         panic("the RSA backend is out of memory");
     std::vector<Bn> held; // the builder refers to them until to_param
@@ -320,43 +208,18 @@ EVP_PKEY *build_pkey(const Object &obj) {
         if (!OSSL_PARAM_BLD_push_BN(bld.get(), c.param, held.back().get()))
             panic("the RSA backend is out of memory");
     }
-    // Secure BNs put the private values in a block OSSL_PARAM_free wipes.
-    std::unique_ptr<OSSL_PARAM, ParamFree> params(OSSL_PARAM_BLD_to_param(bld.get()));
-    PkeyCtx ctx(EVP_PKEY_CTX_new_from_name(nullptr, "RSA", nullptr));
-    EVP_PKEY *pkey = nullptr;
-    if (!params || !ctx || EVP_PKEY_fromdata_init(ctx.get()) != 1 ||
-        EVP_PKEY_fromdata(ctx.get(), &pkey, pair ? EVP_PKEY_KEYPAIR : EVP_PKEY_PUBLIC_KEY, params.get()) != 1)
+    EVP_PKEY *pkey = pkey_from_data("RSA", pair ? EVP_PKEY_KEYPAIR : EVP_PKEY_PUBLIC_KEY, bld.get());
+    if (!pkey)
         panic("the RSA backend could not load a key");
     return pkey;
 }
 
-// prepared_key - the object's key as an EVP_PKEY, from the cache when a
-// key with the same components was prepared lately. The caller owns one
+// prepared_key - the object's key as an EVP_PKEY, from the Tee's cache when
+// a key with the same components was prepared lately. The caller owns one
 // reference.
 EVP_PKEY *prepared_key(const Object &obj) {
-    KeyId id = key_id(obj);
-    Cache &c = cache();
-    std::lock_guard<std::mutex> lock(c.mu);
-    auto it = std::find_if(c.entries.begin(), c.entries.end(),
-                           [&](const CacheEntry &e) { return CRYPTO_memcmp(e.id.data(), id.data(), id.size()) == 0; });
-    EVP_PKEY *pkey = nullptr;
-    if (it != c.entries.end()) {
-        ++c.hits;
-        std::rotate(c.entries.begin(), it, it + 1);
-        pkey = c.entries.front().pkey;
-        if (EVP_PKEY_up_ref(pkey) != 1)
-            panic("the RSA backend failed");
-    } else {
-        ++c.misses;
-        pkey = build_pkey(obj);
-        if (c.entries.size() == kCacheEntries) {
-            drop(c.entries.back());
-            c.entries.pop_back();
-        }
-        if (EVP_PKEY_up_ref(pkey) != 1)
-            panic("the RSA backend failed");
-        c.entries.insert(c.entries.begin(), CacheEntry{id, pkey});
-    }
+    KeyId id = key_id(obj.type, obj.attrs);
+    EVP_PKEY *pkey = crypto_state().rsa_keys.get(id, [&] { return build_pkey(obj); });
     OPENSSL_cleanse(id.data(), id.size());
     return pkey;
 }
@@ -730,19 +593,7 @@ TEE_Result RsaEngine::export_key(Operation &op, uint32_t selector, uint8_t *out,
 
 } // namespace
 
-const ObjectTypeOps *rsa_object_type(uint32_t type) {
-    for (const auto &t : kRsaTypes)
-        if (t.type == type)
-            return &t;
-    return nullptr;
-}
-
-void rsa_minimal_integers(uint32_t type, AttributeMap &attrs) {
-    if (!rsa_object_type(type))
-        return;
-    for (auto &[id, attr] : attrs)
-        strip_leading_zeros(attr.bytes);
-}
+const ObjectTypeOps *rsa_object_type(uint32_t type) { return find_type(kRsaTypes, type); }
 
 TEE_Result rsa_setup(Operation &op) {
     const Algorithm *alg = nullptr;
@@ -759,23 +610,5 @@ TEE_Result rsa_setup(Operation &op) {
     return TEE_SUCCESS;
 }
 
-void rsa_cache_clear() {
-    Cache &c = cache();
-    std::lock_guard<std::mutex> lock(c.mu);
-    for (CacheEntry &e : c.entries)
-        drop(e);
-    c.entries.clear();
-    c.hits = 0;
-    c.misses = 0;
-}
-
 } // namespace detail
-
-namespace rsa_cache {
-Stats stats() {
-    detail::Cache &c = detail::cache();
-    std::lock_guard<std::mutex> lock(c.mu);
-    return Stats{c.hits, c.misses, c.entries.size()};
-}
-} // namespace rsa_cache
 } // namespace tee_host

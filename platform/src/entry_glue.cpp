@@ -4,11 +4,14 @@
  * time, whichever host thread calls.
  */
 #include <atomic>
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <map>
 #include <mutex>
+#include <string>
+#include <unistd.h>
 
 #include "platform_internal.h"
 
@@ -98,25 +101,40 @@ Globals &globals() {
 
 namespace {
 
+bool read_device_id(const std::filesystem::path &file, TEE_UUID *id) {
+    std::ifstream in(file);
+    std::string text;
+    return in && std::getline(in, text) && detail::uuid_from_string(text, id);
+}
+
+// Several processes may start on a new state directory at once: the new
+// identifier is written to a file of this process's own and linked into
+// place, which fails when another got there first; the loser then takes
+// the winner's, so every TEE on one directory has one identity.
 TEE_UUID load_or_create_device_id(const std::filesystem::path &dir) {
     TEE_UUID id{};
     std::filesystem::path file = dir / "device_id";
-    std::ifstream in(file);
-    std::string text;
-    if (in && std::getline(in, text) && detail::uuid_from_string(text, &id))
+    if (read_device_id(file, &id))
         return id;
     detail::system_random(&id, sizeof id);
     id.timeHiAndVersion = static_cast<uint16_t>((id.timeHiAndVersion & 0x0FFF) | 0x4000); // version 4
     id.clockSeqAndNode[0] = static_cast<uint8_t>((id.clockSeqAndNode[0] & 0x3F) | 0x80);
-    std::filesystem::path tmp = dir / "device_id.tmp";
+    std::filesystem::path tmp = dir / ("device_id.tmp." + std::to_string(::getpid()));
     {
         std::ofstream out(tmp, std::ios::trunc);
         out << detail::uuid_to_string(id) << "\n";
+        out.flush();
         if (!out)
             detail::panic("cannot write the device identifier");
     }
-    std::filesystem::rename(tmp, file);
-    return id;
+    int linked = ::link(tmp.c_str(), file.c_str());
+    int err = linked == 0 ? 0 : errno;
+    ::unlink(tmp.c_str());
+    if (linked == 0)
+        return id;
+    if (err == EEXIST && read_device_id(file, &id))
+        return id;
+    detail::panic("cannot create the device identifier");
 }
 
 } // namespace
@@ -136,11 +154,14 @@ Tee::Tee(Config config) : impl_(std::make_unique<Impl>()) {
     impl_->globals.rpmb_usable = config.rpmb_usable;
     impl_->globals.device_id = load_or_create_device_id(config.state_dir);
     detail::system_random(impl_->globals.boot_seed, sizeof impl_->globals.boot_seed);
+    impl_->globals.crypto = detail::start_crypto();
     detail::heap_reset(0x80000);
     detail::clock_reset();
     detail::rng_reset();
     detail::trace_reset(config.trace_level, config.trace_thread_ids);
     g_current = this;
+    // The factory store every device has: the provisioning TA.
+    install_native_ta(detail::make_provisioning_ta(config.state_dir));
 }
 
 Tee::~Tee() {
@@ -153,8 +174,8 @@ Tee::~Tee() {
     for (uint32_t id : ids)
         close_session(id);
     std::memset(impl_->globals.boot_seed, 0, sizeof impl_->globals.boot_seed);
-    detail::rsa_cache_clear();
-    detail::mac_cache_clear();
+    impl_->globals.crypto.reset(); // every cached key and keyed MAC, wiped
+    detail::rng_reset();
     g_current = nullptr;
     if (!impl_->temp_dir.empty()) {
         std::error_code ec;

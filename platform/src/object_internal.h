@@ -3,8 +3,8 @@
  * crypto sources: what a transient or persistent object handle holds, the
  * per-type rules for populating and generating keys, and the handle table.
  *
- * A new key type (RSA, EC) plugs in by providing an ObjectTypeOps and
- * listing its lookup in find_object_type() in objects.cpp.
+ * A key family (RSA, EC) plugs in by providing an ObjectTypeOps per type
+ * and listing its lookup in find_object_type() in objects.cpp.
  */
 #ifndef OBJECT_INTERNAL_H
 #define OBJECT_INTERNAL_H
@@ -73,7 +73,23 @@ struct ObjectTypeOps {
     // TEE_SUCCESS; TEE_ERROR_BAD_PARAMETERS for bad params. On failure attrs
     // may hold partial results, which the caller discards (wiped).
     TEE_Result (*generate)(AttributeMap &attrs, uint32_t bits, const TEE_Attribute *params, uint32_t count);
+    // integers - the buffer attributes are unsigned big-endian integers:
+    // the object keeps (and reads back) each in its shortest form, leading
+    // zero bytes stripped, whatever form the caller gave.
+    bool integers = false;
 };
+
+// generate_public_key - ObjectTypeOps::generate of the public-key types:
+// TEE_ERROR_NOT_SUPPORTED, since GP generates key pairs only.
+TEE_Result generate_public_key(AttributeMap &attrs, uint32_t bits, const TEE_Attribute *params, uint32_t count);
+
+// find_type - the entry of `types` for an object type, or null.
+inline const ObjectTypeOps *find_type(std::span<const ObjectTypeOps> types, uint32_t type) {
+    for (const ObjectTypeOps &t : types)
+        if (t.type == type)
+            return &t;
+    return nullptr;
+}
 
 // find_object_type - the rules for an object type, or null when the
 // platform does not support it.

@@ -7,13 +7,15 @@
  * or forged handle is always recognised and panics instead of reaching
  * freed memory.
  */
+#include <algorithm>
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 #include <mutex>
 #include <unordered_map>
 
 #include "object_internal.h"
-#include "rsa_internal.h"
+#include "pkey_internal.h"
 
 namespace tee_host {
 namespace detail {
@@ -25,9 +27,11 @@ struct HandleTable {
     size_t leaked_at_last_destroy = 0;
 };
 
+// Never destroyed: a Tee kept in a static may still free handles as it
+// ends at process exit, after function-local statics are gone.
 HandleTable &table() {
-    static HandleTable t;
-    return t;
+    static HandleTable *t = new HandleTable;
+    return *t;
 }
 
 // --- Secret-key types --------------------------------------------------------
@@ -69,6 +73,14 @@ constexpr ObjectTypeOps kSecretTypes[] = {
     secret_type<TEE_TYPE_HMAC_SHA512, bytes_between<256, 1024>>,
     secret_type<TEE_TYPE_GENERIC_SECRET, bytes_between<8, 4096>>,
 };
+
+// minimal_integers - each buffer attribute without its leading zero bytes.
+void minimal_integers(AttributeMap &attrs) {
+    for (auto &[id, attr] : attrs) {
+        auto first = std::find_if(attr.bytes.begin(), attr.bytes.end(), [](uint8_t x) { return x != 0; });
+        attr.bytes.erase(attr.bytes.begin(), first);
+    }
+}
 
 bool listed(std::span<const uint32_t> ids, uint32_t id) {
     for (uint32_t x : ids)
@@ -143,15 +155,11 @@ void fill_info(const Object &obj, TEE_ObjectInfo *info) {
 } // namespace
 
 const ObjectTypeOps *secret_object_type(uint32_t type) {
-    for (const auto &t : kSecretTypes)
-        if (t.type == type)
-            return &t;
-    return nullptr;
+    return find_type(kSecretTypes, type);
 }
 
 const ObjectTypeOps *find_object_type(uint32_t type) {
-    // Each key family's lookup; RSA and EC add theirs here.
-    for (auto lookup : {secret_object_type, rsa_object_type})
+    for (auto lookup : {secret_object_type, rsa_object_type, ec_object_type})
         if (const ObjectTypeOps *ops = lookup(type))
             return ops;
     return nullptr;
@@ -179,6 +187,10 @@ std::unique_ptr<Object> copy_key(const Object &src) {
     return dst;
 }
 
+TEE_Result generate_public_key(AttributeMap &, uint32_t, const TEE_Attribute *, uint32_t) {
+    return TEE_ERROR_NOT_SUPPORTED;
+}
+
 const Attribute *find_attribute(const Object &obj, uint32_t id) {
     auto it = obj.attrs.find(id);
     return it == obj.attrs.end() ? nullptr : &it->second;
@@ -191,11 +203,8 @@ EVP_PKEY *object_pkey(Object &obj, EVP_PKEY *(*build)(const Object &obj)) {
 }
 
 uintptr_t next_handle_number() {
-    static std::mutex mu;
-    static uintptr_t next = 0x1000;
-    std::lock_guard<std::mutex> lock(mu);
-    next += 0x10;
-    return next;
+    static std::atomic<uintptr_t> next{0x1000};
+    return next += 0x10;
 }
 
 TEE_ObjectHandle register_object(std::unique_ptr<Object> obj) {
@@ -332,7 +341,8 @@ void TEE_ResetTransientObject(TEE_ObjectHandle object) {
 TEE_Result TEE_PopulateTransientObject(TEE_ObjectHandle object, const TEE_Attribute *attrs, uint32_t attrCount) {
     Object &obj = transient_uninitialized(object, __func__);
     AttributeMap map = collect_attributes(*obj.ops, attrs, attrCount);
-    rsa_minimal_integers(obj.type, map);
+    if (obj.ops->integers)
+        minimal_integers(map);
     uint32_t bits = 0;
     TEE_Result res = obj.ops->key_bits(map, &bits);
     if (res != TEE_SUCCESS)

@@ -3,7 +3,7 @@
  * backends: what an operation holds, the state checks every family makes,
  * and the hook each family provides for TEE_AllocateOperation.
  *
- * A family (digest, MAC, cipher, AE; later RSA and EC) is one source file
+ * A family (digest, MAC, cipher, AE, RSA, EC) is one source file
  * with a setup function and an Engine subclass. crypto_operation.cpp owns
  * the handle, the key, the class/mode/state checks, copy and reset, and
  * routes TEE_AllocateOperation to a family by operation class.
@@ -32,6 +32,9 @@ public:
     virtual ~Engine() = default;
     // accepts_key - whether an object of this type can key the operation.
     virtual bool accepts_key(uint32_t object_type) const = 0;
+    // accepts_key_size - whether a key of this size in bits (no larger
+    // than the operation's maximum) suits the algorithm.
+    virtual bool accepts_key_size(uint32_t) const { return true; }
     // reset - abandons any computation in progress, wiping its state. The
     // key (op.key) stays; engines read it again at their Init.
     virtual void reset() = 0;
@@ -89,11 +92,14 @@ const SecretBytes &secret_value(const Operation &op);
 bool output_fits(uint32_t *len, size_t needed, const char *fn);
 
 // InputView - input that may overlap the output: a private (wiped) copy
-// when the ranges overlap, since EVP reads input after writing output.
-// Panics on null input with a nonzero length, naming fn.
+// when the ranges overlap, since EVP may read input after writing output.
+// in_place: the caller's backend processes input and output at the very
+// same address correctly (it never writes ahead of what it has read), so
+// that case needs no copy. Panics on null input with a nonzero length,
+// naming fn.
 class InputView {
 public:
-    InputView(const void *src, size_t len, const void *dst, size_t dst_len, const char *fn);
+    InputView(const void *src, size_t len, const void *dst, size_t dst_len, const char *fn, bool in_place = false);
     const uint8_t *data() const { return copy_.empty() ? src_ : copy_.data(); }
     size_t size() const { return len_; }
 
@@ -117,9 +123,6 @@ struct HashInfo {
 };
 // hash_info - the hash with that GP number, or null.
 const HashInfo *hash_info(uint32_t gp_hash);
-
-// aes_cipher_name - "AES-<bits>-<mode>" for an AES key size, or null.
-const char *aes_cipher_name(uint32_t key_bits, const char *mode);
 
 // The asymmetric classes (asymmetric cipher and signature, and the export
 // extension) are served by engines deriving from this.

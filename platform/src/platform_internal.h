@@ -5,6 +5,7 @@
 #define PLATFORM_INTERNAL_H
 
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -32,12 +33,23 @@ void clock_reset();
 void rng_reset();
 void trace_reset(int level, bool thread_ids);
 
+// The crypto families' fetched algorithms and caches (crypto_state.h).
+struct CryptoState;
+struct CryptoStateDelete {
+    void operator()(CryptoState *s) const;
+};
+using CryptoStatePtr = std::unique_ptr<CryptoState, CryptoStateDelete>;
+// start_crypto - a fresh crypto state, made as a Tee starts.
+CryptoStatePtr start_crypto();
+
 // Facts of the live Tee; panics when none is alive.
 struct Globals {
     Config config;
     TEE_UUID device_id;
     uint8_t boot_seed[32];
     bool rpmb_usable;
+    // Created as the Tee starts, freed (wiping its secrets) as it ends.
+    CryptoStatePtr crypto;
 };
 Globals &globals();
 

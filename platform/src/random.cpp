@@ -40,6 +40,9 @@ namespace detail {
 void rng_reset() {
     std::lock_guard<std::mutex> lock(state().mu);
     state().scripted.clear();
+    // Bytes drawn for one Tee are never handed out by the next.
+    OPENSSL_cleanse(state().pool, sizeof state().pool);
+    state().pool_left = 0;
 }
 
 void system_random(void *buf, size_t len) {

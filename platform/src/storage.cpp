@@ -19,6 +19,7 @@
 #include <filesystem>
 #include <map>
 #include <mutex>
+#include <string>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -42,7 +43,11 @@ struct StoredObject {
     std::vector<Object *> handles; // open on this object
 
     fs::path file() const { return dir / (name + ".obj"); }
+    // A crash's leftover from before temporaries were named per process.
     fs::path temp() const { return dir / (name + ".tmp"); }
+    // Each process writes its own temporary: TEEs in several processes may
+    // share one state directory.
+    fs::path own_temp() const { return dir / (name + ".tmp." + std::to_string(::getpid())); }
 };
 
 namespace {
@@ -63,9 +68,11 @@ struct StorageState {
     std::map<fs::path, std::weak_ptr<StoredObject>> open; // objects with open handles
 };
 
+// Never destroyed: a Tee kept in a static may still close objects as it
+// ends at process exit, after function-local statics are gone.
 StorageState &state() {
-    static StorageState s;
-    return s;
+    static StorageState *s = new StorageState;
+    return *s;
 }
 
 // --- Locations -----------------------------------------------------------------
@@ -215,13 +222,15 @@ int write_all(int fd, const uint8_t *p, size_t n) {
     return 0;
 }
 
-// replace_file - makes `bytes` the object's file, atomically.
-TEE_Result replace_file(const StoredObject &o, const SecretBytes &bytes) {
+// replace_file - makes `bytes` the object's file, atomically. exclusive:
+// only when no file is there yet (another process may be creating the same
+// object), TEE_ERROR_ACCESS_CONFLICT when one is.
+TEE_Result replace_file(const StoredObject &o, const SecretBytes &bytes, bool exclusive = false) {
     std::error_code ec;
     fs::create_directories(o.dir, ec);
     if (ec)
         return io_error(ec.value());
-    fs::path tmp = o.temp();
+    fs::path tmp = o.own_temp();
     int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
     if (fd < 0)
         return io_error(errno);
@@ -230,8 +239,15 @@ TEE_Result replace_file(const StoredObject &o, const SecretBytes &bytes) {
         err = errno;
     if (::close(fd) != 0 && !err)
         err = errno;
-    if (!err && ::rename(tmp.c_str(), o.file().c_str()) != 0)
+    if (!err && exclusive) {
+        // link() never replaces: of several creators exactly one wins.
+        err = ::link(tmp.c_str(), o.file().c_str()) == 0 ? 0 : errno;
+        ::unlink(tmp.c_str());
+        if (err == EEXIST)
+            return TEE_ERROR_ACCESS_CONFLICT;
+    } else if (!err && ::rename(tmp.c_str(), o.file().c_str()) != 0) {
         err = errno;
+    }
     if (err) {
         ::unlink(tmp.c_str());
         return io_error(err);
@@ -413,7 +429,7 @@ TEE_Result TEE_CreatePersistentObject(uint32_t storageID, const void *objectID, 
         std::error_code ec;
         if (!(flags & TEE_DATA_FLAG_OVERWRITE) && fs::exists(o->file(), ec))
             return TEE_ERROR_ACCESS_CONFLICT;
-        res = replace_file(*o, serialize(*o, o->data));
+        res = replace_file(*o, serialize(*o, o->data), !(flags & TEE_DATA_FLAG_OVERWRITE));
         if (res != TEE_SUCCESS)
             return res;
         handle = new_handle(s, o, flags);
