@@ -183,10 +183,6 @@ TEST_F(Dispatch, CommandsWithoutAHandlerFailVisiblyAndCleanly) {
         uint32_t id;
         const char *name;
     } not_built[] = {
-        {KM_CMD_SOTER_GENERATE_ATTK_KEY_PAIR, "soter_handle_generate_attk_key_pair"},
-        {KM_CMD_SOTER_VERIFY_ATTK_KEY_PAIR, "soter_handle_verify_attk_key_pair"},
-        {KM_CMD_SOTER_EXPORT_ATTK_PUBLIC_KEY, "soter_handle_export_attk_public_key"},
-        {KM_CMD_SOTER_GET_DEVICE_ID, "soter_handle_get_device_id"},
         {KM_CMD_SOTER_SET_FID, "soter_handle_setFid"},
     };
     const uint32_t trusted = open(&trusted_client_uuids[0]);

@@ -138,7 +138,8 @@ std::ostream &operator<<(std::ostream &os, const Outcome &o) {
 }
 
 int sweep_allocations(const std::string &what, const std::function<void()> &setup,
-                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed) {
+                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed,
+                      const std::function<void()> &cleanup) {
     const size_t base = tee_host::heap::stats().live_count;
     for (int n = 1;; ++n) {
         if (setup)
@@ -147,6 +148,8 @@ int sweep_allocations(const std::string &what, const std::function<void()> &setu
         const Outcome o = step();
         const bool fired = tee_host::heap::injected_failure_fired();
         tee_host::heap::fail_nth(0);
+        if (cleanup)
+            cleanup();
         if (!fired)
             return n - 1;
         bool expected = false;

@@ -83,11 +83,13 @@ std::ostream &operator<<(std::ostream &os, const Outcome &o);
 // sweep_allocations - fails the 1st, 2nd, ... TA heap allocation of `step`
 // in turn (after `setup`, which may be null) until a run fires no failure.
 // Every run whose failure fired must end in one of `allowed`, and with as
-// many live TA heap blocks as before the sweep: step ends whatever it and
-// setup began. Reports each violation with `what` and the failure point;
-// returns the number of failure points visited.
+// many live TA heap blocks as before the sweep: step, or `cleanup` (run
+// with no failure armed, may be null), ends whatever step and setup began.
+// Reports each violation with `what` and the failure point; returns the
+// number of failure points visited.
 int sweep_allocations(const std::string &what, const std::function<void()> &setup,
-                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed);
+                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed,
+                      const std::function<void()> &cleanup = nullptr);
 
 Bytes hex(std::string_view s);
 std::string to_hex(const uint8_t *p, size_t n);
