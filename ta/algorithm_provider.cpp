@@ -64,6 +64,23 @@ TEE_Result export_key_unsupported(const uint8_t *, uint32_t, uint8_t *, uint32_t
     return TEE_SUCCESS;
 }
 
+TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,
+                                   const char *func) {
+    const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+    if (size) {
+        if (size->integer == guessed)
+            return TEE_SUCCESS;
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Key size mismatch (given %d, guessed %d)",
+                    static_cast<int>(size->integer), static_cast<int>(guessed));
+        *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+        return TEE_SUCCESS;
+    }
+    TEE_Result res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+    return res;
+}
+
 TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error, const char *func) {
     if (key_param_set_has_tag(params, KM_TAG_ORIGIN)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Shouldn't specify KM_TAG_ORIGIN");

@@ -107,112 +107,91 @@ uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
 
 TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                              int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+            if (!size) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
+                            "No or too many KM_TAG_KEY_SIZE or specified");
+                *error = KM_ERROR_INVALID_ARGUMENT;
+                return false;
+            }
+            const uint32_t key_size = size->integer;
+            if (!valid_bit_length(key_size)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__, "Invalid hmac key size %d",
+                            static_cast<int>(key_size));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            const hmac_digest_t *row = nullptr;
+            *res = check_mac_length_and_digest(params, key_size, &row, error, "hmac_generate_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
 
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (!size) {
-            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const uint32_t key_size = size->integer;
-        if (!valid_bit_length(key_size)) {
-            KM_ERR("Invalid hmac key size %d", static_cast<int>(key_size));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        const hmac_digest_t *row = nullptr;
-        res = check_mac_length_and_digest(params, key_size, &row, error, __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-
-        object_guard obj;
-        res = TEE_AllocateTransientObject(row->key_type, key_size, obj.out());
-        if (res != TEE_SUCCESS) {
-            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
-            break;
-        }
-        res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GenerateKey failed with 0x%08x\n", res);
-            break;
-        }
-        const uint32_t key_bytes = key_size / 8;
-        res = start_key_data(&buf, key_size, row->key_type, key_bytes, 0, error, __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        uint32_t got = key_bytes;
-        res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, buf.get() + kKeyDataHeader, &got);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
-            break;
-        }
-        if (got != key_bytes) {
-            KM_ERR("Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes), static_cast<int>(got));
-            *error = KM_ERROR_UNKNOWN_ERROR;
-            break;
-        }
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+            object_guard obj;
+            *res = TEE_AllocateTransientObject(row->key_type, key_size, obj.out());
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
+                            "AllocateTransientObject failed with 0x%08x\n", *res);
+                return false;
+            }
+            *res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", *res);
+                return false;
+            }
+            const uint32_t key_bytes = key_size / 8;
+            *res = start_key_data(buf, key_size, row->key_type, key_bytes, 0, error, "hmac_generate_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            uint32_t got = key_bytes;
+            *res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, buf->get() + kKeyDataHeader, &got);
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
+                            "GetObjectBufferAttribute failed with 0x%08x\n", *res);
+                return false;
+            }
+            if (got != key_bytes) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
+                            "Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes),
+                            static_cast<int>(got));
+                *error = KM_ERROR_UNKNOWN_ERROR;
+                return false;
+            }
+            return true;
+        });
 }
 
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                            uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
-            KM_ERR("Invalid hmac key size %d", -1);
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        const uint32_t guessed = material_len * 8;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (size) {
-            if (size->integer != guessed) {
-                KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
-                       static_cast<int>(guessed));
-                *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
-                break;
+    return provider_key_slot(
+        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_import_key", __LINE__, "Invalid hmac key size %d", -1);
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
             }
-        } else {
-            res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
-            if (res != TEE_SUCCESS) {
-                KM_ERR("Out of memory");
-                break;
+            const uint32_t guessed = material_len * 8;
+            *res = provider_check_key_size(params, guessed, error);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            if (!valid_bit_length(guessed)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_import_key", __LINE__, "Invalid hmac key size %d",
+                            static_cast<int>(guessed));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
             }
-        }
-        if (!valid_bit_length(guessed)) {
-            KM_ERR("Invalid hmac key size %d", static_cast<int>(guessed));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        const hmac_digest_t *row = nullptr;
-        res = check_mac_length_and_digest(params, guessed, &row, error, __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        res = start_key_data(&buf, guessed, row->key_type, material_len, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
-                             __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        TEE_MemMove(buf.get() + kKeyDataHeader, material, material_len);
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+            const hmac_digest_t *row = nullptr;
+            *res = check_mac_length_and_digest(params, guessed, &row, error, "hmac_import_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = start_key_data(buf, guessed, row->key_type, material_len, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
+                                  "hmac_import_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            TEE_MemMove(buf->get() + kKeyDataHeader, material, material_len);
+            return true;
+        });
 }
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

@@ -167,44 +167,37 @@ TEE_Result write_components(TEE_ObjectHandle obj, uint32_t key_size, const uint3
 
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        uint64_t exponent = 0;
-        uint32_t key_size = 0;
-        if (!generation_params(params, &exponent, &key_size, error))
-            break;
-        object_guard obj;
-        res = generate_pair(key_size, exponent, &obj);
-        if (res != TEE_SUCCESS)
-            break;
-        uint32_t lengths[kRsaComponents] = {};
-        uint64_t total = 0;
-        res = component_lengths(obj.get(), key_size, lengths, &total, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (total > UINT32_MAX || !buf.alloc(static_cast<uint32_t>(total))) {
-            KM_ERR("Out of memory");
-            res = TEE_ERROR_OUT_OF_MEMORY;
-            break;
-        }
-        res = write_components(obj.get(), key_size, lengths, &buf, error);
-        done = res == TEE_SUCCESS && *error == KM_ERROR_OK;
-    } while (false);
-    return out.settle(res, done);
+    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
+                             [&](heap_buf *buf, TEE_Result *res) {
+                                 uint64_t exponent = 0;
+                                 uint32_t key_size = 0;
+                                 if (!generation_params(params, &exponent, &key_size, error))
+                                     return false;
+                                 object_guard obj;
+                                 *res = generate_pair(key_size, exponent, &obj);
+                                 if (*res != TEE_SUCCESS)
+                                     return false;
+                                 uint32_t lengths[kRsaComponents] = {};
+                                 uint64_t total = 0;
+                                 *res = component_lengths(obj.get(), key_size, lengths, &total, error);
+                                 if (*res != TEE_SUCCESS || *error)
+                                     return false;
+                                 if (total > UINT32_MAX || !buf->alloc(static_cast<uint32_t>(total))) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Out of memory");
+                                     *res = TEE_ERROR_OUT_OF_MEMORY;
+                                     return false;
+                                 }
+                                 *res = write_components(obj.get(), key_size, lengths, buf, error);
+                                 return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+                             });
 }
 
 TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
     key_output out(key_data, key_data_len, error);
     heap_buf &buf = out.buf;
-    bool done = false;
     TEE_Result res = TEE_SUCCESS;
+    bool done = false;
     do {
         byte_reader r(material, material_len);
         components_t c{};
@@ -213,22 +206,14 @@ TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *mate
             break;
         }
         const uint32_t consumed = material_len - r.remaining();
-        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
+        res = out.start(params, KM_ORIGIN_IMPORTED);
         if (res != TEE_SUCCESS || *error)
             break;
         const uint64_t guessed64 = uint64_t{c.len[0]} * 8;
         const uint32_t guessed = guessed64 > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(guessed64);
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (size && size->integer != guessed) {
-            KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
-                   static_cast<int>(guessed));
-            *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+        res = provider_check_key_size(params, guessed, error);
+        if (res != TEE_SUCCESS || *error)
             break;
-        }
-        if (!size && (res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed))) != TEE_SUCCESS) {
-            KM_ERR("Out of memory");
-            break;
-        }
         if (!valid_key_size(guessed)) {
             KM_ERR("Invalid RSA key size %d", static_cast<int>(guessed));
             *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;

@@ -170,24 +170,28 @@ TEE_Result init_tee_text(vlb *field, const char *name, const char *no_memory) {
 
 } // namespace
 
-TEE_Result retrieve_key_from_orvel(uint8_t *buf, uint32_t size, uint32_t *used_length) {
+namespace {
+
+// One buffer request with its own success and failure lines.
+TEE_Result orvel_retrieve(uint32_t cmd, const char *what, uint8_t *buf, uint32_t size, uint32_t *used_length,
+                          const char *func) {
     bool invoked = false;
-    TEE_Result res = orvel_buffer_request(kOrvelCmdGetKey, buf, size, used_length, &invoked, __func__);
+    TEE_Result res = orvel_buffer_request(cmd, buf, size, used_length, &invoked, func);
     if (res == TEE_SUCCESS)
-        KM_DEBUG("Retrieve key success\n");
+        KM_TRACE_AT(TEE_TRACE_DEBUG, func, __LINE__, "Retrieve %s success\n", what);
     else if (invoked)
-        KM_ERR("Retrieve key fails, 0x%x\n", res);
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Retrieve %s fails, 0x%x\n", what, res);
     return res;
 }
 
+} // namespace
+
+TEE_Result retrieve_key_from_orvel(uint8_t *buf, uint32_t size, uint32_t *used_length) {
+    return orvel_retrieve(kOrvelCmdGetKey, "key", buf, size, used_length, __func__);
+}
+
 TEE_Result retrieve_data_from_orvel(uint8_t *buf, uint32_t size, uint32_t *used_length) {
-    bool invoked = false;
-    TEE_Result res = orvel_buffer_request(kOrvelCmdGetData, buf, size, used_length, &invoked, __func__);
-    if (res == TEE_SUCCESS)
-        KM_DEBUG("Retrieve TA data success\n");
-    else if (invoked)
-        KM_ERR("Retrieve TA data fails, 0x%x\n", res);
-    return res;
+    return orvel_retrieve(kOrvelCmdGetData, "TA data", buf, size, used_length, __func__);
 }
 
 TEE_Result retrieve_property_from_orvel(const uint8_t *request, uint8_t *output, uint32_t *output_length) {

@@ -226,6 +226,26 @@ TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origi
                                const char *func = __builtin_FUNCTION());
 
 /*
+ * provider_key_slot - the frame of a generate or import slot: the outputs
+ * cleared, origin recorded (a caller-supplied KM_TAG_ORIGIN refused), then
+ * steps(buf, res), which fills buf with the key data and returns true when
+ * done, else sets *res or *error. One exit: key_output::settle.
+ */
+template <typename Steps>
+TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin, uint8_t **key_data,
+                             uint32_t *key_data_len, int32_t *error, Steps steps,
+                             const char *func = __builtin_FUNCTION());
+
+/*
+ * provider_check_key_size - an import's key size: the caller's
+ * KM_TAG_KEY_SIZE must equal the size the material shows ("Key size
+ * mismatch (given %d, guessed %d)", *error -44); without one, the guessed
+ * size is added (TEE_ERROR_OUT_OF_MEMORY when the set cannot grow).
+ */
+TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,
+                                   const char *func = __builtin_FUNCTION());
+
+/*
  * key_output - the key data a provider's generate or import slot builds.
  * It clears the slot's outputs and error when made; settle() is the slot's
  * one exit: on success the buffer becomes the key data (the caller frees
@@ -239,6 +259,10 @@ class key_output {
         *key_data = nullptr;
         *key_data_len = 0;
         *error = KM_ERROR_OK;
+    }
+    /* start - refuses a caller-supplied KM_TAG_ORIGIN and records origin (provider_set_origin). */
+    TEE_Result start(keymaster_key_param_set_t *params, uint32_t origin, const char *func = __builtin_FUNCTION()) {
+        return provider_set_origin(params, origin, error_, func);
     }
     TEE_Result settle(TEE_Result res, bool done) {
         settle_error(res, done, error_);
@@ -255,6 +279,15 @@ class key_output {
     uint32_t *key_data_len_;
     int32_t *error_;
 };
+
+template <typename Steps>
+TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin, uint8_t **key_data,
+                             uint32_t *key_data_len, int32_t *error, Steps steps, const char *func) {
+    key_output out(key_data, key_data_len, error);
+    TEE_Result res = out.start(params, origin, func);
+    const bool done = res == TEE_SUCCESS && *error == KM_ERROR_OK && steps(&out.buf, &res);
+    return out.settle(res, done);
+}
 
 /* export_key_unsupported - the export slot of providers without an export format. */
 TEE_Result export_key_unsupported(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
