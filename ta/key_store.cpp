@@ -143,12 +143,19 @@ TEE_Result key_store_init_rpmb_ksk() {
         }
         res = TEE_CreatePersistentObject(TEE_STORAGE_PRIVATE_RPMB, kKskObjectId, sizeof kKskObjectId,
                                          TEE_DATA_FLAG_ACCESS_READ, TEE_HANDLE_NULL, secret, kKskSize, pobj.out());
-        if (res != TEE_SUCCESS) {
+        if (res == TEE_SUCCESS) {
+            rpmb_ksk = ksk.release();
+            return TEE_SUCCESS;
+        }
+        if (res != TEE_ERROR_ACCESS_CONFLICT) {
             KM_ERR("CreatePersistentObject failed with 0x%08x\n", res);
             return res;
         }
-        rpmb_ksk = ksk.release();
-        return TEE_SUCCESS;
+        // Another TEE on the same storage created it first: every blob must
+        // be sealed with one KSK, so use the winner's.
+        TEE_MemFill(secret, 0, sizeof secret);
+        res = TEE_OpenPersistentObject(TEE_STORAGE_PRIVATE_RPMB, kKskObjectId, sizeof kKskObjectId,
+                                       TEE_DATA_FLAG_ACCESS_READ, pobj.out());
     }
     if (res != TEE_SUCCESS) {
         KM_ERR("Open KSK failed with 0x%08x\n", res);
@@ -339,6 +346,28 @@ TEE_Result save_key(const uint8_t *key_data, uint32_t key_data_len, const keymas
     return TEE_SUCCESS;
 }
 
+namespace {
+
+// The blob-decrypting AES-GCM operation of a blob whose header is at blob:
+// the KSK its protection byte names, the blob key derived from it, and the
+// nonce. *unknown when the protection byte names no KSK.
+TEE_Result start_blob_decryption(const uint8_t *blob, operation_guard *op, bool *unknown,
+                                 const char *func = __builtin_FUNCTION()) {
+    TEE_ObjectHandle ksk = nullptr;
+    TEE_Result res = select_ksk(blob[0], &ksk, unknown, func);
+    if (res != TEE_SUCCESS || *unknown)
+        return res;
+    object_guard kk;
+    res = TEE_DeriveKK(ksk, blob + kBlobDeriveOffset, kk.out());
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "DeriveKK failed with 0x%08x\n", res);
+        return res;
+    }
+    return start_gcm(kk.get(), TEE_MODE_DECRYPT, blob + kBlobNonceOffset, op);
+}
+
+} // namespace
+
 TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, uint32_t *key_data_len,
                     keymaster_key_param_set_t *params, int32_t *error) {
     *key_data = nullptr;
@@ -351,25 +380,15 @@ TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, 
         *error = KM_ERROR_INVALID_KEY_BLOB;
         return TEE_SUCCESS;
     }
-    TEE_ObjectHandle ksk = nullptr;
+    operation_guard op;
     bool unknown = false;
-    TEE_Result res = select_ksk(blob[0], &ksk, &unknown);
+    TEE_Result res = start_blob_decryption(blob, &op, &unknown);
     if (res != TEE_SUCCESS)
         return res;
     if (unknown) {
         *error = KM_ERROR_INVALID_KEY_BLOB;
         return TEE_SUCCESS;
     }
-    object_guard kk;
-    res = TEE_DeriveKK(ksk, blob + kBlobDeriveOffset, kk.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("DeriveKK failed with 0x%08x\n", res);
-        return res;
-    }
-    operation_guard op;
-    res = start_gcm(kk.get(), TEE_MODE_DECRYPT, blob + kBlobNonceOffset, &op);
-    if (res != TEE_SUCCESS)
-        return res;
 
     const uint32_t plain_len = blob_len - kBlobHeaderSize;
     heap_buf plain(true);
@@ -429,23 +448,13 @@ TEE_Result open_key_raw(uint8_t *buf, uint32_t *len) {
         KM_ERR("Too short key blob");
         return TEE_ERROR_BAD_PARAMETERS;
     }
-    TEE_ObjectHandle ksk = nullptr;
+    operation_guard op;
     bool unknown = false;
-    TEE_Result res = select_ksk(buf[0], &ksk, &unknown);
+    TEE_Result res = start_blob_decryption(buf, &op, &unknown);
     if (res != TEE_SUCCESS)
         return res;
     if (unknown)
         return TEE_ERROR_BAD_PARAMETERS;
-    object_guard kk;
-    res = TEE_DeriveKK(ksk, buf + kBlobDeriveOffset, kk.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("DeriveKK failed with 0x%08x\n", res);
-        return res;
-    }
-    operation_guard op;
-    res = start_gcm(kk.get(), TEE_MODE_DECRYPT, buf + kBlobNonceOffset, &op);
-    if (res != TEE_SUCCESS)
-        return res;
     uint8_t tag[kBlobTagSize];
     TEE_MemMove(tag, buf + kBlobTagOffset, kBlobTagSize);
     uint32_t out_len = *len - kBlobHeaderSize;
@@ -465,4 +474,6 @@ TEE_Result key_store_delete_key(const uint8_t *, uint32_t blob_len, int32_t *err
     return TEE_SUCCESS;
 }
 
-TEE_Result key_store_delete_all_keys() { return TEE_SUCCESS; }
+TEE_Result key_store_delete_all_keys() {
+    return TEE_SUCCESS;
+}

@@ -4,6 +4,7 @@
  * wire shapes over a scripted transport and over the embedded TEE.
  */
 #include <algorithm>
+#include <cstring>
 #include <deque>
 #include <functional>
 #include <stdexcept>
@@ -13,6 +14,7 @@
 #include <openssl/bio.h>
 #include <openssl/bn.h>
 #include <openssl/core_names.h>
+#include <openssl/encoder.h>
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
 #include <openssl/pem.h>
@@ -274,22 +276,87 @@ TEST(KeyMaterial, RsaComponentsInTheirOrder) {
     EXPECT_TRUE(BN_is_one(t.get())) << "e d = 1 mod (p - 1)";
 }
 
-TEST(KeyMaterial, RsaRefusesWhatIsNotAnUnencryptedPkcs8RsaKey) {
+// A private key as OpenSSL's encoders write it: output "PEM" or "DER",
+// structure "PrivateKeyInfo" (PKCS#8), "EncryptedPrivateKeyInfo" (with
+// pass) or "type-specific" (PKCS#1, SEC 1).
+Bytes encoded(EVP_PKEY *key, const char *output, const char *structure, const char *pass = nullptr) {
+    std::unique_ptr<OSSL_ENCODER_CTX, decltype(&OSSL_ENCODER_CTX_free)> ctx(
+        OSSL_ENCODER_CTX_new_for_pkey(key, OSSL_KEYMGMT_SELECT_KEYPAIR, output, structure, nullptr),
+        &OSSL_ENCODER_CTX_free);
+    EXPECT_TRUE(ctx && OSSL_ENCODER_CTX_get_num_encoders(ctx.get()) > 0) << output << " " << structure;
+    if (pass) {
+        EXPECT_EQ(OSSL_ENCODER_CTX_set_cipher(ctx.get(), "AES-256-CBC", nullptr), 1);
+        EXPECT_EQ(OSSL_ENCODER_CTX_set_passphrase(ctx.get(), reinterpret_cast<const unsigned char *>(pass),
+                                                  std::strlen(pass)),
+                  1);
+    }
+    unsigned char *data = nullptr;
+    size_t len = 0;
+    EXPECT_EQ(OSSL_ENCODER_to_data(ctx.get(), &data, &len), 1);
+    Bytes out(data, data + len);
+    OPENSSL_free(data);
+    return out;
+}
+
+km::Passphrase passphrase(const char *text, int *asked) {
+    return [text, asked]() -> std::optional<std::string> {
+        ++*asked;
+        if (!text)
+            return std::nullopt;
+        return std::string(text);
+    };
+}
+
+// Every default form OpenSSL writes gives the same material; the passphrase
+// is asked for only when the key is encrypted.
+TEST(KeyMaterial, EveryFormOpenSslWritesGivesTheSameMaterial) {
+    for (const char *algorithm : {"RSA", "EC"}) {
+        SCOPED_TRACE(algorithm);
+        const bool rsa = std::strcmp(algorithm, "RSA") == 0;
+        Pkey key(rsa ? EVP_PKEY_Q_keygen(nullptr, nullptr, "RSA", size_t{1024})
+                     : EVP_PKEY_Q_keygen(nullptr, nullptr, "EC", "P-256"));
+        ASSERT_TRUE(key);
+        auto convert = [rsa](const Bytes &in, const km::Passphrase &pass, std::string *why) {
+            return rsa ? km::rsa_import_material(in, pass, why) : km::ec_import_material(in, pass, why);
+        };
+        std::string why;
+        int asked = 0;
+        const std::optional<Bytes> reference = convert(pkcs8_der(key.get()), passphrase(nullptr, &asked), &why);
+        ASSERT_TRUE(reference) << why;
+        const std::pair<const char *, Bytes> plain[] = {
+            {"PKCS#8 PEM", encoded(key.get(), "PEM", "PrivateKeyInfo")},
+            {"traditional PEM", encoded(key.get(), "PEM", "type-specific")},
+            {"traditional DER", encoded(key.get(), "DER", "type-specific")},
+        };
+        for (const auto &[form, bytes] : plain) {
+            SCOPED_TRACE(form);
+            EXPECT_EQ(convert(bytes, passphrase(nullptr, &asked), &why), reference) << why;
+        }
+        EXPECT_EQ(asked, 0) << "asked for the passphrase of a plain key";
+        for (const char *output : {"PEM", "DER"}) {
+            SCOPED_TRACE(output);
+            const Bytes encrypted = encoded(key.get(), output, "EncryptedPrivateKeyInfo", "secret");
+            asked = 0;
+            EXPECT_EQ(convert(encrypted, passphrase("secret", &asked), &why), reference) << why;
+            EXPECT_GE(asked, 1);
+            EXPECT_FALSE(convert(encrypted, passphrase("wrong", &asked), &why));
+            EXPECT_EQ(why, "the passphrase does not decrypt the key");
+            EXPECT_FALSE(convert(encrypted, passphrase(nullptr, &asked), &why));
+            EXPECT_EQ(why, "the key is encrypted: give its passphrase with --passin");
+        }
+    }
+}
+
+TEST(KeyMaterial, RsaRefusesWhatIsNotAnRsaPrivateKey) {
     Pkey rsa(EVP_PKEY_Q_keygen(nullptr, nullptr, "RSA", size_t{1024}));
     Pkey ec(EVP_PKEY_Q_keygen(nullptr, nullptr, "EC", "P-256"));
     ASSERT_TRUE(rsa && ec);
-
-    std::unique_ptr<BIO, PkeyFree> pkcs1(BIO_new(BIO_s_mem()));
-    ASSERT_EQ(PEM_write_bio_PrivateKey_traditional(pkcs1.get(), rsa.get(), nullptr, nullptr, 0, nullptr, nullptr), 1);
-    std::unique_ptr<BIO, PkeyFree> encrypted(BIO_new(BIO_s_mem()));
-    char pass[] = "secret";
-    ASSERT_EQ(PEM_write_bio_PKCS8PrivateKey(encrypted.get(), rsa.get(), EVP_aes_128_cbc(), pass, 6, nullptr, nullptr),
-              1);
     Bytes der = pkcs8_der(rsa.get());
     Bytes trailing = der;
     trailing.push_back(0);
     const Bytes truncated(der.begin(), der.end() - 1);
     const std::string text = "not a key at all";
+    const Bytes public_only = spki_der(rsa.get());
 
     struct Case {
         const char *what;
@@ -297,12 +364,11 @@ TEST(KeyMaterial, RsaRefusesWhatIsNotAnUnencryptedPkcs8RsaKey) {
         const char *reason;
     };
     const Case cases[] = {
-        {"PKCS#1 PEM", bio_bytes(pkcs1.get()), "BEGIN PRIVATE KEY"},
-        {"encrypted PKCS#8", bio_bytes(encrypted.get()), "unencrypted"},
-        {"an EC key", pkcs8_der(ec.get()), "not an RSA key"},
-        {"truncated DER", truncated, "not a DER PKCS#8"},
-        {"trailing byte", trailing, "not a DER PKCS#8"},
-        {"text", Bytes(text.begin(), text.end()), "not a DER PKCS#8"},
+        {"an EC key", encoded(ec.get(), "PEM", "type-specific"), "not an RSA key"},
+        {"a public key", public_only, "not a private key"},
+        {"truncated DER", truncated, "not a private key"},
+        {"trailing byte", trailing, "bytes follow the DER key"},
+        {"text", Bytes(text.begin(), text.end()), "not a private key"},
         {"empty", {}, "empty"},
     };
     for (const Case &c : cases) {

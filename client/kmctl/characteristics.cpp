@@ -7,8 +7,9 @@
 #include <iostream>
 #include <memory>
 
+#include <nlohmann/json.hpp>
+
 #include "common.h"
-#include "json.h"
 #include "keymaster_defs.h"
 #include "km/names.h"
 #include "km/param_text.h"
@@ -49,7 +50,7 @@ void print_text(const km::ParamSet &set, std::ostream &out) {
     }
 }
 
-void json_value(JsonWriter &json, const km::Param &p) {
+nlohmann::ordered_json json_value(const km::Param &p) {
     switch (km::tag_type(p.tag)) {
     case KM_ENUM:
     case KM_ENUM_REP: {
@@ -57,42 +58,35 @@ void json_value(JsonWriter &json, const km::Param &p) {
         std::string name = km::param_value_text(p);
         // A value without a name stays a number.
         if (info && info->values != km::Enumeration::none && name != std::to_string(p.value))
-            json.value(name);
-        else
-            json.value(p.value);
-        break;
+            return name;
+        return p.value;
     }
     case KM_DATE:
-        json.value(km::format_date(p.value));
-        break;
+        return km::format_date(p.value);
     case KM_BOOL:
-        json.value(p.value != 0);
-        break;
+        return p.value != 0;
     case KM_BYTES:
     case KM_BIGNUM:
-        json.begin_object().key("length").value(uint64_t{p.bytes.size()}).end_object();
-        break;
+        return {{"length", p.bytes.size()}};
     default:
-        json.value(p.value);
-        break;
+        return p.value;
     }
 }
 
 void print_json(const km::ParamSet &set, std::ostream &out) {
-    JsonWriter json(out);
-    json.begin_object();
+    nlohmann::ordered_json json = nlohmann::ordered_json::object();
     for (const auto &[tag, params] : grouped(set)) {
-        json.key(km::tag_name(tag));
         // Repeatable tags are always arrays, so that readers need not guess.
-        bool array = km::tag_repeatable(tag) || params.size() > 1;
-        if (array)
-            json.begin_array(true);
-        for (const km::Param *p : params)
-            json_value(json, *p);
-        if (array)
-            json.end_array();
+        if (km::tag_repeatable(tag) || params.size() > 1) {
+            nlohmann::ordered_json values = nlohmann::ordered_json::array();
+            for (const km::Param *p : params)
+                values.push_back(json_value(*p));
+            json[km::tag_name(tag)] = std::move(values);
+        } else {
+            json[km::tag_name(tag)] = json_value(*params.front());
+        }
     }
-    json.end_object();
+    out << json.dump(2) << '\n';
 }
 
 } // namespace

@@ -6,11 +6,17 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <chrono>
+#include <condition_variable>
 #include <cstring>
-#include <fstream>
-#include <iterator>
+#include <iostream>
+#include <mutex>
+#include <thread>
 #include <map>
 
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "tee_api_extensions.h"
@@ -23,27 +29,72 @@ std::string env(const char *name) {
     return v ? std::string(v) : std::string();
 }
 
-std::unique_ptr<km::EmbeddedTee> start_tee(const GlobalOptions &options) {
-    std::filesystem::path dir =
-        options.state_dir.empty() ? default_state_dir() : std::filesystem::path(options.state_dir);
+std::filesystem::path make_state_dir(const GlobalOptions &options) {
+    std::filesystem::path dir = options.state_given ? std::filesystem::path(options.state_dir) : default_state_dir();
     std::error_code ec;
     bool created = std::filesystem::create_directories(dir, ec);
     if (ec)
         throw Failure(kExitLocal, "cannot create the state directory " + dir.string() + ": " + ec.message());
-    // Key material lives here: keep it to its owner.
-    if (created)
-        std::filesystem::permissions(dir, std::filesystem::perms::owner_all, ec);
     if (!std::filesystem::is_directory(dir, ec))
-        throw Failure(kExitLocal, "the state directory " + dir.string() + " is not a directory");
-    return std::make_unique<km::EmbeddedTee>(dir, options.trace_level);
+        throw Failure(kExitLocal, "cannot use the state directory " + dir.string() + ": it is not a directory");
+    if (created) {
+        // Key material lives here: keep it to its owner.
+        std::filesystem::permissions(dir, std::filesystem::perms::owner_all, ec);
+        std::cerr << "kmctl: created the state directory " << dir.string() << '\n';
+    }
+    return dir;
 }
 
 } // namespace
 
+StateLock::StateLock(const std::filesystem::path &dir) {
+    std::string file = (dir / "lock").string();
+    fd_ = ::open(file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    if (fd_ < 0)
+        throw Failure(kExitLocal, "cannot lock the state directory " + dir.string() + ": " + std::strerror(errno));
+    if (::flock(fd_, LOCK_EX | LOCK_NB) == 0)
+        return;
+    // Another kmctl has the TEE: wait for it, and say so if it takes a while.
+    std::mutex mu;
+    std::condition_variable cv;
+    bool done = false;
+    std::thread notice([&] {
+        std::unique_lock<std::mutex> lock(mu);
+        if (!cv.wait_for(lock, std::chrono::seconds(1), [&] { return done; }))
+            std::cerr << "kmctl: waiting for another kmctl using the state directory " << dir.string() << '\n';
+    });
+    int res = 0;
+    while ((res = ::flock(fd_, LOCK_EX)) != 0 && errno == EINTR) {
+    }
+    int err = errno;
+    {
+        std::lock_guard<std::mutex> lock(mu);
+        done = true;
+    }
+    cv.notify_one();
+    notice.join();
+    if (res != 0) {
+        ::close(fd_);
+        throw Failure(kExitLocal, "cannot lock the state directory " + dir.string() + ": " + std::strerror(err));
+    }
+}
+
+StateLock::~StateLock() {
+    // Closing the descriptor releases the lock.
+    ::close(fd_);
+}
+
 void add_global_options(CLI::App &app, GlobalOptions &options) {
-    app.add_option("--state", options.state_dir,
-                   "Directory of the TEE's persistent state (default: $KMCTL_STATE, $XDG_STATE_HOME/kmctl "
-                   "or ~/.local/state/kmctl)")
+    app.add_option_function<std::string>(
+           "--state",
+           [&options](const std::string &dir) {
+               if (dir.empty())
+                   throw CLI::ValidationError("--state", "the state directory must not be empty");
+               options.state_dir = dir;
+               options.state_given = true;
+           },
+           "Directory of the TEE's persistent state (default: $KMCTL_STATE, $XDG_STATE_HOME/kmctl "
+           "or ~/.local/state/kmctl)")
         ->type_name("DIR");
     static const std::map<std::string, int> kLevels = {{"none", 0},
                                                        {"error", TEE_TRACE_ERROR},
@@ -57,7 +108,7 @@ void add_global_options(CLI::App &app, GlobalOptions &options) {
                options.trace_level = it == kLevels.end() ? TEE_TRACE_ERROR : it->second;
            },
            "Platform trace lines shown on stderr: none, error, info, debug or flow (default: error)")
-        ->check(CLI::IsMember({"none", "error", "info", "debug", "flow"}))
+        ->transform(CLI::IsMember({"none", "error", "info", "debug", "flow"}, CLI::ignore_case))
         ->type_name("LEVEL");
 }
 
@@ -75,7 +126,9 @@ std::filesystem::path default_state_dir() {
     throw Failure(kExitUsage, "no state directory: pass --state DIR or set KMCTL_STATE");
 }
 
-Session::Session(const GlobalOptions &options) : tee_(start_tee(options)), client_(*tee_) {
+Session::Session(const GlobalOptions &options)
+    : state_dir_(make_state_dir(options)), lock_(state_dir_),
+      tee_(std::make_unique<km::EmbeddedTee>(state_dir_, options.trace_level)), client_(*tee_) {
     km::Status opened{tee_->open(), 0};
     check(opened);
 }
@@ -85,10 +138,24 @@ void usage_error(const std::string &message) {
 }
 
 void check(const km::Status &status) {
-    if (status.tee_failed())
-        throw Failure(kExitTeeFailure, km::describe(status));
     if (status.refused())
         throw Failure(kExitRefused, km::describe(status));
+    if (!status.tee_failed())
+        return;
+    const std::string code = " (" + km::describe(status) + ")";
+    switch (status.tee) {
+    case TEE_ERROR_MAC_INVALID:
+    case TEE_ERROR_CORRUPT_OBJECT:
+        // Only a key blob is sealed under a MAC: a user's mistake, not the TEE's.
+        throw Failure(kExitRefused, "the key blob is damaged or was made with another state directory" + code);
+    case TEE_ERROR_STORAGE_NOT_AVAILABLE:
+    case TEE_ERROR_STORAGE_NO_SPACE:
+        throw Failure(kExitTeeFailure, "the TEE cannot use its storage in the state directory" + code);
+    case TEE_ERROR_OUT_OF_MEMORY:
+        throw Failure(kExitTeeFailure, "the TEE ran out of memory" + code);
+    default:
+        throw Failure(kExitTeeFailure, "the TEE failed the command" + code);
+    }
 }
 
 CLI::Option *add_in_option(CLI::App &app, std::string &path, const std::string &what, bool required) {
@@ -118,49 +185,20 @@ void check_one_stdin(std::initializer_list<std::pair<const char *, const std::st
 }
 
 std::vector<uint8_t> read_input(const std::string &path) {
-    if (path == "-") {
-        std::vector<uint8_t> data;
-        uint8_t chunk[4096] = {};
-        size_t n = 0;
-        while ((n = std::fread(chunk, 1, sizeof chunk, stdin)) > 0)
-            data.insert(data.end(), chunk, chunk + n);
-        if (std::ferror(stdin))
-            throw Failure(kExitLocal, "cannot read stdin");
-        return data;
-    }
-    std::ifstream in(path, std::ios::binary);
-    if (!in)
-        throw Failure(kExitLocal, "cannot open " + path + ": " + std::strerror(errno));
-    std::vector<uint8_t> data((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    if (in.bad())
-        throw Failure(kExitLocal, "cannot read " + path);
+    InputStream in(path);
+    std::vector<uint8_t> data;
+    uint8_t chunk[16384] = {};
+    size_t n = 0;
+    while ((n = in.read(chunk, sizeof chunk)) > 0)
+        data.insert(data.end(), chunk, chunk + n);
+    explicit_bzero(chunk, sizeof chunk);
     return data;
 }
 
 void write_output(const std::string &path, std::span<const uint8_t> data) {
-    if (path == "-") {
-        if (std::fwrite(data.data(), 1, data.size(), stdout) != data.size() || std::fflush(stdout) != 0)
-            throw Failure(kExitLocal, "cannot write stdout");
-        return;
-    }
-    // Write beside the target and rename, so that a failed write never
-    // leaves a truncated file where a good one was.
-    std::string temp = path + ".tmp." + std::to_string(::getpid());
-    {
-        std::ofstream out(temp, std::ios::binary | std::ios::trunc);
-        out.write(reinterpret_cast<const char *>(data.data()), static_cast<std::streamsize>(data.size()));
-        out.close();
-        if (!out) {
-            std::remove(temp.c_str());
-            throw Failure(kExitLocal, "cannot write " + path);
-        }
-    }
-    std::error_code ec;
-    std::filesystem::rename(temp, path, ec);
-    if (ec) {
-        std::remove(temp.c_str());
-        throw Failure(kExitLocal, "cannot write " + path + ": " + ec.message());
-    }
+    OutputStream out(path);
+    out.write(data);
+    out.commit();
 }
 
 void write_output(const std::string &path, std::string_view text) {
@@ -178,75 +216,148 @@ std::vector<uint8_t> text_bytes(const std::string &text) {
 
 InputStream::InputStream(const std::string &path) : name_(path == "-" ? "stdin" : path) {
     if (path == "-") {
-        file_ = stdin;
+        fd_ = STDIN_FILENO;
         return;
     }
-    file_ = std::fopen(path.c_str(), "rb");
-    if (!file_)
-        throw Failure(kExitLocal, "cannot open " + path + ": " + std::strerror(errno));
+    fd_ = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd_ < 0)
+        throw Failure(kExitLocal, "cannot read " + path + ": " + std::strerror(errno));
     owned_ = true;
+    struct stat st {};
+    if (::fstat(fd_, &st) == 0 && S_ISDIR(st.st_mode)) {
+        ::close(fd_);
+        owned_ = false;
+        throw Failure(kExitLocal, "cannot read " + path + ": it is a directory, not a file");
+    }
 }
 
 InputStream::~InputStream() {
     if (owned_)
-        std::fclose(file_);
+        ::close(fd_);
 }
 
 size_t InputStream::read(uint8_t *buf, size_t n) {
     size_t got = 0;
-    while (got < n) {
-        size_t r = std::fread(buf + got, 1, n - got, file_);
+    while (got < n && !at_end_) {
+        ssize_t r = ::read(fd_, buf + got, n - got);
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r < 0)
+            throw Failure(kExitLocal, "cannot read " + name_ + ": " + std::strerror(errno));
         if (r == 0)
-            break;
-        got += r;
+            at_end_ = true;
+        got += static_cast<size_t>(r);
     }
-    if (std::ferror(file_))
-        throw Failure(kExitLocal, "cannot read " + name_);
     return got;
 }
 
-OutputStream::OutputStream(const std::string &path) : path_(path) {
+namespace {
+
+// The file a path finally names, through any chain of symbolic links, so
+// that a link is written through rather than replaced. Relative targets
+// are read from the link's own directory.
+std::filesystem::path final_target(const std::filesystem::path &path) {
+    std::filesystem::path p = path;
+    for (int hops = 0; hops < 40; ++hops) {
+        std::error_code ec;
+        if (!std::filesystem::is_symlink(std::filesystem::symlink_status(p, ec)))
+            return p;
+        std::filesystem::path next = std::filesystem::read_symlink(p, ec);
+        if (ec)
+            return p;
+        p = next.is_absolute() ? next : p.parent_path() / next;
+    }
+    throw Failure(kExitLocal, "cannot write " + path.string() + ": " + std::strerror(ELOOP));
+}
+
+void write_all(int fd, std::span<const uint8_t> data, const std::string &name) {
+    const uint8_t *p = data.data();
+    size_t left = data.size();
+    while (left > 0) {
+        ssize_t w = ::write(fd, p, left);
+        if (w < 0 && errno == EINTR)
+            continue;
+        if (w <= 0)
+            throw Failure(kExitLocal, "cannot write " + name + ": " + std::strerror(w < 0 ? errno : EIO));
+        p += w;
+        left -= static_cast<size_t>(w);
+    }
+}
+
+} // namespace
+
+OutputStream::OutputStream(const std::string &path) : name_(path == "-" ? "stdout" : path) {
     if (path == "-") {
-        file_ = stdout;
+        fd_ = STDOUT_FILENO;
         return;
     }
-    // Written beside the target and renamed, as write_output does.
-    temp_ = path + ".tmp." + std::to_string(::getpid());
-    file_ = std::fopen(temp_.c_str(), "wb");
-    if (!file_)
+    struct stat st {};
+    if (::stat(path.c_str(), &st) == 0 && !S_ISREG(st.st_mode)) {
+        if (S_ISDIR(st.st_mode))
+            throw Failure(kExitLocal, "cannot write " + path + ": it is a directory, not a file");
+        // A device, a FIFO, /dev/stdout: written as a stream, never replaced.
+        fd_ = ::open(path.c_str(), O_WRONLY | O_CLOEXEC);
+        if (fd_ < 0)
+            throw Failure(kExitLocal, "cannot write " + path + ": " + std::strerror(errno));
+        owned_ = true;
+        return;
+    }
+    // A regular file (or none yet) is written beside its target and renamed
+    // into place, so a failed command never leaves a truncated file where a
+    // good one was.
+    target_ = final_target(path).string();
+    temp_ = target_ + ".tmp." + std::to_string(::getpid());
+    fd_ = ::open(temp_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+    if (fd_ < 0 && errno == EEXIST) {
+        // A leftover of this pid from a killed run.
+        ::unlink(temp_.c_str());
+        fd_ = ::open(temp_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+    }
+    if (fd_ < 0)
         throw Failure(kExitLocal, "cannot write " + path + ": " + std::strerror(errno));
+    owned_ = true;
+    // A replaced file keeps its permissions.
+    if (::stat(target_.c_str(), &st) == 0)
+        ::fchmod(fd_, st.st_mode & 07777);
 }
 
 OutputStream::~OutputStream() {
-    if (temp_.empty() || committed_)
-        return;
-    std::fclose(file_);
-    std::remove(temp_.c_str());
+    if (owned_ && fd_ >= 0)
+        ::close(fd_);
+    if (!temp_.empty() && !committed_)
+        ::unlink(temp_.c_str());
 }
 
 void OutputStream::write(std::span<const uint8_t> data) {
-    if (data.empty())
-        return;
-    if (std::fwrite(data.data(), 1, data.size(), file_) != data.size())
-        throw Failure(kExitLocal, "cannot write " + (temp_.empty() ? std::string("stdout") : path_));
+    if (!data.empty())
+        write_all(fd_, data, name_);
 }
 
 void OutputStream::commit() {
     if (temp_.empty()) {
-        if (std::fflush(stdout) != 0)
-            throw Failure(kExitLocal, "cannot write stdout");
+        // A device's own write error (a full disk behind it) shows at fsync
+        // or close; stdout and character devices cannot be synced, harmlessly.
+        if (owned_) {
+            int err = ::fsync(fd_) == 0 || errno == EINVAL || errno == EROFS ? 0 : errno;
+            int closed = ::close(fd_);
+            fd_ = -1;
+            if (!err && closed != 0)
+                err = errno;
+            if (err)
+                throw Failure(kExitLocal, "cannot write " + name_ + ": " + std::strerror(err));
+        }
         committed_ = true;
         return;
     }
-    int closed = std::fclose(file_);
+    int err = ::fsync(fd_) == 0 ? 0 : errno;
+    if (::close(fd_) != 0 && !err)
+        err = errno;
+    fd_ = -1;
+    if (!err && ::rename(temp_.c_str(), target_.c_str()) != 0)
+        err = errno;
+    if (err)
+        throw Failure(kExitLocal, "cannot write " + name_ + ": " + std::strerror(err));
     committed_ = true;
-    std::error_code ec;
-    if (closed == 0)
-        std::filesystem::rename(temp_, path_, ec);
-    if (closed != 0 || ec) {
-        std::remove(temp_.c_str());
-        throw Failure(kExitLocal, "cannot write " + path_ + (ec ? ": " + ec.message() : std::string()));
-    }
 }
 
 } // namespace kmctl

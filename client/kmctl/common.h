@@ -44,7 +44,8 @@ private:
 };
 
 struct GlobalOptions {
-    std::string state_dir; // empty: default_state_dir()
+    std::string state_dir;    // when state_given
+    bool state_given = false; // otherwise default_state_dir()
     int trace_level = 1;   // the platform trace threshold, error (1) to flow (4)
 };
 
@@ -55,16 +56,34 @@ void add_global_options(CLI::App &app, GlobalOptions &options);
 // $HOME/.local/state/kmctl. Throws Failure (usage) when none is set.
 std::filesystem::path default_state_dir();
 
+// StateLock - an exclusive lock on the state directory, held by one
+// embedded TEE at a time, so that kmctl processes sharing a directory run
+// one after another. Waits for the lock, saying so on stderr after one
+// second. Throws Failure (local) when the lock file cannot be used.
+class StateLock {
+public:
+    explicit StateLock(const std::filesystem::path &dir);
+    ~StateLock();
+    StateLock(const StateLock &) = delete;
+    StateLock &operator=(const StateLock &) = delete;
+
+private:
+    int fd_ = -1;
+};
+
 // Session - the embedded TEE started on the state directory, which is
-// created when missing, with a session open and a client on it. Throws
-// Failure: local when the directory cannot be made, TEE failure when the
-// session cannot be opened. One Session per process.
+// created when missing (saying so on stderr) and locked for the session's
+// life, with a session open and a client on it. Throws Failure: local when
+// the directory cannot be made or locked, TEE failure when the session
+// cannot be opened. One Session per process.
 class Session {
 public:
     explicit Session(const GlobalOptions &options);
     km::Client &client() { return client_; }
 
 private:
+    std::filesystem::path state_dir_;
+    StateLock lock_;
     std::unique_ptr<km::EmbeddedTee> tee_;
     km::Client client_;
 };
@@ -122,14 +141,18 @@ public:
     size_t read(uint8_t *buf, size_t n);
 
 private:
-    std::FILE *file_ = nullptr;
+    int fd_ = -1;
     bool owned_ = false;
+    bool at_end_ = false;
     std::string name_;
 };
 
-// OutputStream - stdout for "-", else a temporary file beside path that
-// commit renames into place; destroyed without commit, it removes the
-// temporary and leaves path as it was. Throws Failure (local).
+// OutputStream - stdout for "-"; a path that exists and is not a regular
+// file (a device, a FIFO, /dev/stdout) written as a stream; otherwise a
+// temporary file beside the path's final target (symbolic links are
+// followed) that commit renames into place. Destroyed without commit, it
+// removes the temporary and leaves the target as it was. Every failure
+// throws Failure (local) with the reason.
 class OutputStream {
 public:
     explicit OutputStream(const std::string &path);
@@ -141,9 +164,11 @@ public:
     void commit();
 
 private:
-    std::FILE *file_ = nullptr;
-    std::string path_;
-    std::string temp_; // empty for stdout
+    int fd_ = -1;
+    bool owned_ = false;
+    std::string name_;   // as the user gave it, for messages
+    std::string target_; // the regular file replaced on commit
+    std::string temp_;   // empty when streaming
     bool committed_ = false;
 };
 

@@ -25,7 +25,7 @@ Command add_export(CLI::App &kmctl, const GlobalOptions &options) {
     CLI::App *app = kmctl.add_subcommand("export", "Write the public key of an RSA or EC key");
     add_key_options(*app, o->key);
     app->add_option("--format", o->format, "pem (default) or der")
-        ->check(CLI::IsMember({"pem", "der"}))
+        ->transform(CLI::IsMember({"pem", "der"}, CLI::ignore_case))
         ->type_name("FORMAT");
     add_out_option(*app, o->out, "The public key", true);
     return {app, [o, &options] {

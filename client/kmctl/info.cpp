@@ -4,8 +4,9 @@
 #include <iostream>
 #include <memory>
 
+#include <nlohmann/json.hpp>
+
 #include "common.h"
-#include "json.h"
 #include "keymaster_defs.h"
 #include "km/names.h"
 
@@ -81,34 +82,33 @@ void print_table(const std::vector<AlgorithmSupport> &support, std::ostream &out
     }
 }
 
-void json_list(JsonWriter &json, std::string_view key, km::Enumeration e, const km::ValueList &values) {
-    json.key(key).begin_array(true);
+nlohmann::ordered_json json_list(km::Enumeration e, const km::ValueList &values) {
+    nlohmann::ordered_json list = nlohmann::ordered_json::array();
     for (uint32_t v : values)
-        json.value(km::enum_name(e, v));
-    json.end_array();
+        list.push_back(km::enum_name(e, v));
+    return list;
 }
 
 void print_json(const std::vector<AlgorithmSupport> &support, std::ostream &out) {
-    JsonWriter json(out);
-    json.begin_object().key("algorithms").begin_array();
+    nlohmann::ordered_json algorithms = nlohmann::ordered_json::array();
     for (const AlgorithmSupport &a : support) {
-        json.begin_object();
-        json.key("name").value(km::enum_name(km::Enumeration::algorithm, a.algorithm));
-        json.key("value").value(a.algorithm);
-        json.key("purposes").begin_object();
-        for (const PurposeSupport &p : a.purposes) {
-            json.key(km::enum_name(km::Enumeration::purpose, p.purpose)).begin_object();
-            json_list(json, "block_modes", km::Enumeration::block_mode, p.block_modes);
-            json_list(json, "paddings", km::Enumeration::padding, p.paddings);
-            json_list(json, "digests", km::Enumeration::digest, p.digests);
-            json.end_object();
-        }
-        json.end_object();
-        json_list(json, "import_formats", km::Enumeration::key_format, a.import_formats);
-        json_list(json, "export_formats", km::Enumeration::key_format, a.export_formats);
-        json.end_object();
+        nlohmann::ordered_json purposes = nlohmann::ordered_json::object();
+        for (const PurposeSupport &p : a.purposes)
+            purposes[km::enum_name(km::Enumeration::purpose, p.purpose)] = {
+                {"block_modes", json_list(km::Enumeration::block_mode, p.block_modes)},
+                {"paddings", json_list(km::Enumeration::padding, p.paddings)},
+                {"digests", json_list(km::Enumeration::digest, p.digests)},
+            };
+        algorithms.push_back({
+            {"name", km::enum_name(km::Enumeration::algorithm, a.algorithm)},
+            {"value", a.algorithm},
+            {"purposes", std::move(purposes)},
+            {"import_formats", json_list(km::Enumeration::key_format, a.import_formats)},
+            {"export_formats", json_list(km::Enumeration::key_format, a.export_formats)},
+        });
     }
-    json.end_array().end_object();
+    nlohmann::ordered_json json = {{"algorithms", std::move(algorithms)}};
+    out << json.dump(2) << '\n';
 }
 
 } // namespace

@@ -2,15 +2,22 @@
  * main.cpp - kmctl: parses the command line and runs the chosen subcommand.
  */
 #include <iostream>
+#include <new>
 #include <string>
 #include <vector>
 
 #include "common.h"
 
+namespace kmctl {
+// add_soter - `kmctl soter` and its subcommands (soter.cpp).
+Command add_soter(CLI::App &kmctl, const GlobalOptions &options);
+} // namespace kmctl
+
 int main(int argc, char **argv) {
     CLI::App app("Drive the Keymaster TA on the embedded TEE.", "kmctl");
     kmctl::GlobalOptions options;
     kmctl::add_global_options(app, options);
+    app.set_version_flag("--version", "kmctl " KM_VERSION, "Print kmctl's version and exit");
     app.require_subcommand(1);
     // Global options may also follow the subcommand.
     app.fallthrough();
@@ -22,6 +29,7 @@ int main(int argc, char **argv) {
         kmctl::add_sign(app, options),    kmctl::add_verify(app, options),
         kmctl::add_encrypt(app, options), kmctl::add_decrypt(app, options),
     };
+    commands.push_back(kmctl::add_soter(app, options));
 
     try {
         app.parse(argc, argv);
@@ -45,6 +53,9 @@ int main(int argc, char **argv) {
         } catch (const kmctl::Failure &f) {
             std::cerr << f.what() << '\n';
             return f.code();
+        } catch (const std::bad_alloc &) {
+            std::cerr << "kmctl: out of memory\n";
+            return kmctl::kExitLocal;
         } catch (const std::exception &e) {
             std::cerr << "kmctl: " << e.what() << '\n';
             return kmctl::kExitLocal;

@@ -34,19 +34,24 @@ struct OperationOptions {
 };
 
 // add_operation_options - --key, --app-id, --app-data, --digest,
-// --padding, --mac-length, --param, --in and --out; with_cipher adds
-// --block-mode, --nonce and --aad.
-void add_operation_options(CLI::App &app, OperationOptions &o, bool with_cipher);
+// --padding, --mac-length and --param, their help naming only what applies
+// to the purpose; encrypt and decrypt add --block-mode, --nonce and --aad.
+void add_operation_options(CLI::App &app, OperationOptions &o, uint32_t purpose);
 
 // begin_params - the begin parameters the options give, application id
 // and data included. Throws Failure (usage) for a bad value.
 km::ParamSet begin_params(const OperationOptions &o);
 
-// add_default_mac_length - for an HMAC key, whose operations need
-// KM_TAG_MAC_LENGTH, adds bits (or, when bits is 0, the full length of the
-// key's digest) unless params already carry one. Other keys are left
-// alone. Reads the key's characteristics; throws Failure as check does.
-void add_default_mac_length(km::Client &client, const km::KeyReference &key, km::ParamSet &params, uint32_t bits);
+// complete_params - reads the key's characteristics and completes the
+// begin parameters: an HMAC MAC length (the digest's, or for verify the
+// given MAC's), refusing one longer than the digest (usage; for verify a
+// MAC that long is KM_ERROR_VERIFICATION_FAILED); the key's only block
+// mode, padding and digest where the command gave none, refusing (usage,
+// naming the option) when the key has several; a GCM tag length. RSA
+// public-key operations keep what was given, encrypt warning on stderr
+// when the key's decryption refuses its padding. Throws Failure.
+void complete_params(km::Client &client, const km::KeyReference &key, km::ParamSet &params, uint32_t purpose,
+                     size_t signature_bytes);
 
 // run_operation - begin for purpose, then the whole input streamed
 // through the operation (km::Client::stream): first_update's parameters

@@ -69,6 +69,98 @@ void add_new_key_options(CLI::App &app, NewKeyOptions &desc) {
         ->type_name("NAME[=VALUE]");
 }
 
+uint32_t digest_bits(uint32_t digest) {
+    switch (digest) {
+    case KM_DIGEST_MD5:
+        return 128;
+    case KM_DIGEST_SHA1:
+        return 160;
+    case KM_DIGEST_SHA_2_224:
+        return 224;
+    case KM_DIGEST_SHA_2_256:
+        return 256;
+    case KM_DIGEST_SHA_2_384:
+        return 384;
+    case KM_DIGEST_SHA_2_512:
+        return 512;
+    default:
+        return 0;
+    }
+}
+
+namespace {
+
+bool has_value(const km::ParamSet &set, uint32_t tag, uint32_t value) {
+    for (const km::Param &p : set.params())
+        if (p.tag == tag && p.value == value)
+            return true;
+    return false;
+}
+
+// What kmctl can tell is wrong with an RSA key before any TEE starts.
+void check_rsa(const km::ParamSet &set, bool generating) {
+    const km::Param *size = set.find(KM_TAG_KEY_SIZE);
+    if (generating && size && (size->value % 8 != 0 || size->value < 512 || size->value > 8192))
+        usage_error("--size: an RSA key is 512 to 8192 bits, a multiple of 8 (2048 is usual), not " +
+                    std::to_string(size->value));
+    const km::Param *e = set.find(KM_TAG_RSA_PUBLIC_EXPONENT);
+    if (generating && e && (e->value % 2 == 0 || e->value < 3))
+        usage_error("--exponent: an RSA public exponent is odd and at least 3 (65537 is usual), not " +
+                    std::to_string(e->value));
+}
+
+} // namespace
+
+void add_key_defaults(km::ParamSet &set, uint32_t alg, bool generating) {
+    const bool rsa = alg == KM_ALGORITHM_RSA;
+    const bool signs =
+        has_value(set, KM_TAG_PURPOSE, KM_PURPOSE_SIGN) || has_value(set, KM_TAG_PURPOSE, KM_PURPOSE_VERIFY);
+    const bool ciphers =
+        has_value(set, KM_TAG_PURPOSE, KM_PURPOSE_ENCRYPT) || has_value(set, KM_TAG_PURPOSE, KM_PURPOSE_DECRYPT);
+    if (generating && !set.find(KM_TAG_KEY_SIZE)) {
+        if (rsa)
+            set.add(KM_TAG_KEY_SIZE, 2048);
+        else if (alg == KM_ALGORITHM_EC)
+            set.add(KM_TAG_KEY_SIZE, 256);
+        else if (alg == KM_ALGORITHM_AES)
+            usage_error("an AES key needs --size: 128, 192 or 256");
+    }
+    // The TA wants an exponent; an import reads it from the key instead.
+    if (generating && rsa && !set.find(KM_TAG_RSA_PUBLIC_EXPONENT))
+        set.add(KM_TAG_RSA_PUBLIC_EXPONENT, 65537);
+    if (rsa)
+        check_rsa(set, generating);
+    if (alg != KM_ALGORITHM_AES && !set.find(KM_TAG_DIGEST))
+        set.add(KM_TAG_DIGEST, KM_DIGEST_SHA_2_256);
+    if (rsa && !set.find(KM_TAG_PADDING)) {
+        if (signs) {
+            set.add(KM_TAG_PADDING, KM_PAD_RSA_PSS);
+            set.add(KM_TAG_PADDING, KM_PAD_RSA_PKCS1_1_5_SIGN);
+        }
+        if (ciphers)
+            set.add(KM_TAG_PADDING, KM_PAD_RSA_OAEP);
+    }
+    if (alg == KM_ALGORITHM_AES && !set.find(KM_TAG_BLOCK_MODE))
+        usage_error("an AES key needs --block-mode: ecb, cbc, ctr or gcm");
+    if (alg == KM_ALGORITHM_HMAC) {
+        // The shortest digest's length: a MAC can never be longer.
+        uint32_t shortest = 0;
+        for (const km::Param &p : set.params())
+            if (p.tag == KM_TAG_DIGEST && digest_bits(static_cast<uint32_t>(p.value)) != 0 &&
+                (shortest == 0 || digest_bits(static_cast<uint32_t>(p.value)) < shortest))
+                shortest = digest_bits(static_cast<uint32_t>(p.value));
+        if (generating && !set.find(KM_TAG_KEY_SIZE) && shortest != 0)
+            set.add(KM_TAG_KEY_SIZE, shortest);
+        if (!set.find(KM_TAG_MIN_MAC_LENGTH) && shortest != 0)
+            set.add(KM_TAG_MIN_MAC_LENGTH, shortest);
+    }
+    if (alg == KM_ALGORITHM_AES && has_value(set, KM_TAG_BLOCK_MODE, KM_MODE_GCM) && !set.find(KM_TAG_MIN_MAC_LENGTH))
+        set.add(KM_TAG_MIN_MAC_LENGTH, 128);
+    // A key with neither is refused every operation for want of an auth token.
+    if (!set.find(KM_TAG_NO_AUTH_REQUIRED) && !set.find(KM_TAG_USER_SECURE_ID))
+        set.add_bool(KM_TAG_NO_AUTH_REQUIRED);
+}
+
 km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool generating) {
     std::optional<uint32_t> alg = km::parse_enum(km::Enumeration::algorithm, desc.algorithm);
     if (!alg)
@@ -106,12 +198,7 @@ km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool gen
         set.add_bytes(KM_TAG_APPLICATION_DATA, text_bytes(desc.app_data));
     for (const std::string &t : desc.tags)
         add_param_text(set, "--tag", t);
-    // The TA wants an exponent; an import reads it from the key instead.
-    if (generating && *alg == KM_ALGORITHM_RSA && !set.find(KM_TAG_RSA_PUBLIC_EXPONENT))
-        set.add(KM_TAG_RSA_PUBLIC_EXPONENT, 65537);
-    // A key with neither is refused every operation for want of an auth token.
-    if (!set.find(KM_TAG_NO_AUTH_REQUIRED) && !set.find(KM_TAG_USER_SECURE_ID))
-        set.add_bool(KM_TAG_NO_AUTH_REQUIRED);
+    add_key_defaults(set, *alg, generating);
     check_single_tags(set);
     return set;
 }

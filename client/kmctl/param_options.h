@@ -56,12 +56,22 @@ struct NewKeyOptions {
 // --app-id, --app-data and --tag on app.
 void add_new_key_options(CLI::App &app, NewKeyOptions &desc);
 
-// key_params - the key's parameter set. Without --purpose the key gets
-// every purpose its algorithm has; without KM_TAG_NO_AUTH_REQUIRED or
-// KM_TAG_USER_SECURE_ID among the tags it gets KM_TAG_NO_AUTH_REQUIRED,
-// so that it can be used without an auth token. When generating an RSA
-// key without an exponent, the exponent is 65537. *algorithm receives the
-// algorithm's value.
+// digest_bits - a digest's output length in bits; 0 for none or unknown.
+uint32_t digest_bits(uint32_t digest);
+
+// add_key_defaults - completes a new key's parameters so that the key is
+// usable as it is (the defaults table of the README): RSA 2048 bits with
+// exponent 65537 when generated, EC 256 bits, digest sha256 (RSA, EC,
+// HMAC), RSA paddings for the key's purposes (PSS and PKCS#1 for signing,
+// OAEP for encryption), an HMAC key's size and minimum MAC length from its
+// shortest digest, 128-bit minimum GCM tags, and KM_TAG_NO_AUTH_REQUIRED
+// unless auth is configured. Refuses (usage) an AES key without a size or
+// block mode, and an RSA size or exponent the TEE cannot generate.
+void add_key_defaults(km::ParamSet &set, uint32_t algorithm, bool generating);
+
+// key_params - the key's parameter set: the options given, every purpose
+// of the algorithm without --purpose, then add_key_defaults. *algorithm
+// receives the algorithm's value. Throws Failure (usage).
 km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool generating);
 
 } // namespace kmctl

@@ -12,7 +12,7 @@ namespace kmctl {
 Command add_sign(CLI::App &kmctl, const GlobalOptions &options) {
     auto o = std::make_shared<OperationOptions>();
     CLI::App *app = kmctl.add_subcommand("sign", "Sign (or MAC) the input with a key");
-    add_operation_options(*app, *o, false);
+    add_operation_options(*app, *o, KM_PURPOSE_SIGN);
     add_in_option(*app, o->in, "The message");
     add_out_option(*app, o->out, "The signature", true);
     return {app, [o, &options] {
@@ -21,8 +21,7 @@ Command add_sign(CLI::App &kmctl, const GlobalOptions &options) {
                 km::KeyReference key = key_reference(o->key);
                 InputStream in(o->in);
                 Session session(options);
-                // HMAC needs a MAC length; the whole digest is the natural one.
-                add_default_mac_length(session.client(), key, params, 0);
+                complete_params(session.client(), key, params, KM_PURPOSE_SIGN, 0);
                 km::Bytes signature;
                 km::FinishOutput done = run_operation(session.client(), KM_PURPOSE_SIGN, key, params, {}, in, {},
                                                       [&signature](std::span<const uint8_t> d) {

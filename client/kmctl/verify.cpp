@@ -21,7 +21,7 @@ struct VerifyOptions {
 Command add_verify(CLI::App &kmctl, const GlobalOptions &options) {
     auto o = std::make_shared<VerifyOptions>();
     CLI::App *app = kmctl.add_subcommand("verify", "Verify a signature (or MAC) over the input; exit 0 when it holds");
-    add_operation_options(*app, o->op, false);
+    add_operation_options(*app, o->op, KM_PURPOSE_VERIFY);
     add_in_option(*app, o->op.in, "The message");
     app->add_option("--signature", o->signature, "The signature to check (- for stdin)")->required()->type_name("SIG");
     return {app, [o, &options] {
@@ -32,7 +32,7 @@ Command add_verify(CLI::App &kmctl, const GlobalOptions &options) {
                 InputStream in(o->op.in);
                 Session session(options);
                 // An HMAC verification checks as many bits as the MAC it is given.
-                add_default_mac_length(session.client(), key, params, static_cast<uint32_t>(signature.size() * 8));
+                complete_params(session.client(), key, params, KM_PURPOSE_VERIFY, signature.size());
                 run_operation(session.client(), KM_PURPOSE_VERIFY, key, params, {}, in, signature,
                               [](std::span<const uint8_t>) {});
             }};

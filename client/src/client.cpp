@@ -378,4 +378,66 @@ Status Client::abort(uint32_t handle) {
     return exchange(transport_, KM_CMD_ABORT, handle, nullptr, 0).status;
 }
 
+namespace {
+
+constexpr uint32_t kSoterOutput = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_OUTPUT, TEE_PARAM_TYPE_NONE,
+                                                  TEE_PARAM_TYPE_MEMREF_OUTPUT, TEE_PARAM_TYPE_NONE);
+// Room for a PEM public key of up to 4096 bits and for any device identifier.
+constexpr size_t kSoterCapacity = 2048;
+
+// A SOTER command with an output buffer in params[2]; the TA's code in status.km.
+Exchange soter_output(Transport &transport, uint32_t cmd) {
+    Exchange x;
+    Bytes out(kSoterCapacity, 0);
+    TEE_Param params[4] = {};
+    params[2].memref.buffer = out.data();
+    params[2].memref.size = static_cast<uint32_t>(out.size());
+    x.status.tee = transport.invoke(cmd, kSoterOutput, params);
+    if (x.status.tee_failed())
+        return x;
+    x.status.km = static_cast<int32_t>(params[0].value.a);
+    if (x.status.refused())
+        return x;
+    if (params[2].memref.size > out.size()) {
+        x.status.tee = TEE_ERROR_BAD_FORMAT;
+        return x;
+    }
+    out.resize(params[2].memref.size);
+    x.response = std::move(out);
+    return x;
+}
+
+} // namespace
+
+Status Client::soter_load_attk() {
+    return exchange(transport_, KM_CMD_SOTER_GENERATE_ATTK_KEY_PAIR, 0, nullptr, 0).status;
+}
+
+Result<int32_t> Client::soter_verify_attk() {
+    Exchange x = exchange(transport_, KM_CMD_SOTER_VERIFY_ATTK_KEY_PAIR, 0, nullptr, 0);
+    Result<int32_t> r;
+    r.status.tee = x.status.tee;
+    r.value = x.status.km;
+    return r;
+}
+
+Result<std::string> Client::soter_export_attk() {
+    Exchange x = soter_output(transport_, KM_CMD_SOTER_EXPORT_ATTK_PUBLIC_KEY);
+    Result<std::string> r{x.status, {}};
+    if (!r.ok())
+        return r;
+    // The TA counts the text's NUL; a text without one is garbled.
+    if (x.response.empty() || x.response.back() != 0) {
+        r.status.tee = TEE_ERROR_BAD_FORMAT;
+        return r;
+    }
+    r.value.assign(x.response.begin(), x.response.end() - 1);
+    return r;
+}
+
+Result<Bytes> Client::soter_device_id() {
+    Exchange x = soter_output(transport_, KM_CMD_SOTER_GET_DEVICE_ID);
+    return {x.status, std::move(x.response)};
+}
+
 } // namespace km

@@ -159,6 +159,22 @@ public:
     // KM_ERROR_INVALID_OPERATION_HANDLE when it is already gone.
     Status abort(uint32_t handle);
 
+    // SOTER commands. Their codes are the TA's own, not all Keymaster
+    // errors: a refusal carries the raw code in status.km.
+    // soter_load_attk - command 0xFF00: the TA loads its SOTER state from
+    // the provisioning TA; refused with -1000 when that fails.
+    Status soter_load_attk();
+    // soter_verify_attk - command 0xFF01: the TA's verdict as the value, 0
+    // when the provisioning TA's key loads, -1 when it has none, -2 for any
+    // other failure; status reports only TEE failures.
+    Result<int32_t> soter_verify_attk();
+    // soter_export_attk - command 0xFF02: the ATTK public key as PEM text
+    // (without the NUL the TA counts). Refusals: -38 no buffer, -1 the
+    // SOTER state does not load, -1000 the export failed.
+    Result<std::string> soter_export_attk();
+    // soter_device_id - command 0xFF03: the device identifier bytes.
+    Result<Bytes> soter_device_id();
+
 private:
     // Runs a count command then its list command with a buffer of exactly
     // four bytes per entry.
