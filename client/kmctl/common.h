@@ -189,6 +189,7 @@ Command add_sign(CLI::App &kmctl, const GlobalOptions &options);
 Command add_verify(CLI::App &kmctl, const GlobalOptions &options);
 Command add_encrypt(CLI::App &kmctl, const GlobalOptions &options);
 Command add_decrypt(CLI::App &kmctl, const GlobalOptions &options);
+Command add_demo(CLI::App &kmctl, const GlobalOptions &options);
 
 } // namespace kmctl
 

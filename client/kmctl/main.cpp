@@ -30,6 +30,7 @@ int main(int argc, char **argv) {
         kmctl::add_encrypt(app, options), kmctl::add_decrypt(app, options),
     };
     commands.push_back(kmctl::add_soter(app, options));
+    commands.push_back(kmctl::add_demo(app, options));
 
     try {
         app.parse(argc, argv);
