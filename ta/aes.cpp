@@ -1,8 +1,414 @@
 /*
- * aes.cpp - the AES provider: capability lists, purpose tables and
- * parameter getters.
+ * aes.cpp - the AES provider: key generation and import, key data, the
+ * shared core of the encrypt and decrypt operations, and the capability
+ * tables.
  */
+#include "aes.h"
+
 #include "algorithm_provider.h"
+#include "byte_io.h"
+#include "ta_log.h"
+#include "tee_guard.h"
+
+namespace {
+
+constexpr uint32_t kKeyDataHeader = 4; // the key size word
+constexpr uint32_t kCbcCtrNonce = 16;
+constexpr uint32_t kGcmNonce = 12;
+constexpr uint32_t kMaxNonce = 16;
+
+bool valid_key_size(uint32_t bits) {
+    return bits == 128 || bits == 192 || bits == 256;
+}
+
+// Generation's GCM rule: every GCM block mode (or no block mode at all)
+// needs one KM_TAG_MIN_MAC_LENGTH of 96 to 128 bits in whole bytes.
+void check_min_mac_length(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
+    bool wanted = !key_param_set_has_tag(params, KM_TAG_BLOCK_MODE);
+    for (uint32_t i = 0; params->params && i < params->length; ++i)
+        if (params->params[i].tag == KM_TAG_BLOCK_MODE && params->params[i].enumerated == KM_MODE_GCM)
+            wanted = true;
+    if (!wanted)
+        return;
+    const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
+    if (!min_mac) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH");
+        *error = KM_ERROR_MISSING_MIN_MAC_LENGTH;
+        return;
+    }
+    const uint32_t bits = min_mac->integer;
+    if (bits < 96 || bits > 128 || bits % 8 != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d", static_cast<int>(bits));
+        *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
+    }
+}
+
+// The TEE algorithm and nonce length of a block mode, and whether it takes PKCS#7.
+struct aes_mode_t {
+    uint32_t block_mode;
+    uint32_t algorithm;
+    uint32_t nonce_len; // 0: no nonce
+    bool pkcs7;
+};
+
+constexpr aes_mode_t kModes[] = {
+    {KM_MODE_ECB, TEE_ALG_AES_ECB_NOPAD, 0, true},
+    {KM_MODE_CBC, TEE_ALG_AES_CBC_NOPAD, kCbcCtrNonce, true},
+    {KM_MODE_CTR, TEE_ALG_AES_CTR, kCbcCtrNonce, false},
+    {KM_MODE_GCM, TEE_ALG_AES_GCM, kGcmNonce, false},
+};
+
+const aes_mode_t *find_mode(uint32_t block_mode) {
+    for (const aes_mode_t &m : kModes)
+        if (m.block_mode == block_mode)
+            return &m;
+    return nullptr;
+}
+
+// Steps 3 and 4 of create: block mode, padding and (GCM) the MAC length.
+bool read_begin_params(aes_operation_t *op, keymaster_key_param_set_t *in_params, int32_t *error, const char *func) {
+    const key_param_t *mode = key_param_set_find_unique(in_params, KM_TAG_BLOCK_MODE);
+    if (!mode) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_BLOCK_MODE");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return false;
+    }
+    op->block_mode = mode->enumerated;
+    const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
+    op->padding = padding ? padding->enumerated : static_cast<uint32_t>(KM_PAD_NONE);
+    if (op->block_mode != KM_MODE_GCM)
+        return true;
+    const key_param_t *mac_length = key_param_set_find_unique(in_params, KM_TAG_MAC_LENGTH);
+    if (!mac_length) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MAC_LENGTH");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+        return false;
+    }
+    // Below 96 bits the TEE refuses the tag length anyway; saying so here
+    // gives the caller the precise error instead of an unknown one.
+    const uint32_t bits = mac_length->integer;
+    if (bits < 96 || bits > 128 || bits % 8 != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported mac length %d", static_cast<int>(bits));
+        *error = KM_ERROR_UNSUPPORTED_MAC_LENGTH;
+        return false;
+    }
+    op->mac_length = bits;
+    return true;
+}
+
+// Step 6 of create: the nonce given or drawn initialises the operation
+// and, except for ECB, goes back to the caller in out_params.
+bool start_with_nonce(aes_operation_t *op, const aes_mode_t &mode, keymaster_key_param_set_t *in_params,
+                      keymaster_key_param_set_t *out_params, int32_t *error, const char *func) {
+    const key_param_t *given = key_param_set_find_unique(in_params, KM_TAG_NONCE);
+    uint8_t nonce[kMaxNonce] = {};
+    if (given) {
+        if (mode.nonce_len == 0) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "ECB takes no nonce");
+            *error = KM_ERROR_INVALID_TAG;
+            return false;
+        }
+        if (given->blob.data_length != mode.nonce_len || !given->blob.data) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid nonce length %d, expected %d",
+                        static_cast<int>(given->blob.data_length), static_cast<int>(mode.nonce_len));
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            return false;
+        }
+        TEE_MemMove(nonce, given->blob.data, mode.nonce_len);
+    } else if (mode.nonce_len) {
+        TEE_GenerateRandom(nonce, mode.nonce_len);
+    }
+    if (mode.block_mode == KM_MODE_GCM) {
+        TEE_Result res = TEE_AEInit(op->operation, nonce, mode.nonce_len, op->mac_length, 0, 0);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AEInit failed with 0x%08x\n", res);
+            return false;
+        }
+    } else {
+        TEE_CipherInit(op->operation, mode.nonce_len ? nonce : nullptr, mode.nonce_len);
+    }
+    if (mode.nonce_len == 0)
+        return true;
+    heap_buf copy;
+    if (!copy.alloc(mode.nonce_len)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return false;
+    }
+    TEE_MemMove(copy.get(), nonce, mode.nonce_len);
+    key_param_t param{};
+    param.tag = KM_TAG_NONCE;
+    param.blob.data = copy.get();
+    param.blob.data_length = mode.nonce_len;
+    if (key_param_set_add(out_params, param) != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return false;
+    }
+    copy.release(); // the parameter set owns it now
+    return true;
+}
+
+// Allocates one hold-back buffer of a decryption record.
+bool hold_back_buffer(uint8_t **buf, uint32_t len, int32_t *error, const char *func) {
+    *buf = static_cast<uint8_t *>(ta_malloc(len));
+    if (!*buf) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return false;
+    }
+    return true;
+}
+
+} // namespace
+
+TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                            int32_t *error) {
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+
+    do {
+        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (!size) {
+            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        const uint32_t key_size = size->integer;
+        if (!valid_key_size(key_size)) {
+            KM_ERR("Invalid AES key size %d", static_cast<int>(key_size));
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        check_min_mac_length(params, error, __func__);
+        if (*error)
+            break;
+
+        object_guard obj;
+        res = TEE_AllocateTransientObject(TEE_TYPE_AES, key_size, obj.out());
+        if (res != TEE_SUCCESS) {
+            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+            break;
+        }
+        res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("GenerateKey failed with 0x%08x\n", res);
+            break;
+        }
+        const uint32_t key_bytes = key_size / 8;
+        if (!buf.alloc(kKeyDataHeader + key_bytes)) {
+            KM_ERR("Out of memory");
+            res = TEE_ERROR_OUT_OF_MEMORY;
+            break;
+        }
+        byte_writer w(buf.get(), buf.len());
+        uint8_t *key = nullptr;
+        if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        uint32_t got = key_bytes;
+        res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, key, &got);
+        if (res != TEE_SUCCESS) {
+            KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
+            break;
+        }
+        if (got != key_bytes) {
+            KM_ERR("Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes), static_cast<int>(got));
+            *error = KM_ERROR_UNKNOWN_ERROR;
+            break;
+        }
+        done = true;
+    } while (false);
+    return out.settle(res, done);
+}
+
+TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                          uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+
+    do {
+        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
+            KM_ERR("Invalid AES key size %d", -1);
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        const uint32_t guessed = material_len * 8;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (size) {
+            if (size->integer != guessed) {
+                KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
+                       static_cast<int>(guessed));
+                *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+                break;
+            }
+        } else {
+            res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
+            if (res != TEE_SUCCESS) {
+                KM_ERR("Out of memory");
+                break;
+            }
+        }
+        if (!valid_key_size(guessed)) {
+            KM_ERR("Invalid AES key size %d", static_cast<int>(guessed));
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        if (!buf.alloc(kKeyDataHeader + material_len)) {
+            KM_ERR("Out of memory");
+            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+            break;
+        }
+        byte_writer w(buf.get(), buf.len());
+        if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        done = true;
+    } while (false);
+    return out.settle(res, done);
+}
+
+TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
+                                uint32_t *key_size, int32_t *error) {
+    *object = nullptr;
+    if (key_size)
+        *key_size = 0;
+    byte_reader r(key_data, key_data_len);
+    uint32_t bits = 0;
+    const uint8_t *key = nullptr;
+    if (!r.read_u32(&bits) || !r.read_bytes(bits / 8, &key))
+        return TEE_ERROR_GENERIC;
+    TEE_Attribute attr{};
+    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
+    object_guard obj;
+    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_AES, bits, obj.out());
+    if (res != TEE_SUCCESS) {
+        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
+    if (res != TEE_SUCCESS) {
+        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    *object = obj.release();
+    if (key_size)
+        *key_size = bits;
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+operation_t *aes_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                                  keymaster_key_param_set_t *out_params, uint32_t mode, int32_t *error,
+                                  const operation_fns_t *fns, const char *func) {
+    operation_t *header = operation_record_alloc(fns, func);
+    if (!header) {
+        key_param_set_release(out_params);
+        return nullptr;
+    }
+    auto *op = operation_record<aes_operation_t>(header);
+    const bool decrypting = mode == TEE_MODE_DECRYPT;
+    bool ok = [&] {
+        TEE_Result res = aes_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error);
+        if (res != TEE_SUCCESS || *error) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+            return false;
+        }
+        if (!read_begin_params(op, in_params, error, func))
+            return false;
+        if (decrypting && op->block_mode == KM_MODE_GCM &&
+            !hold_back_buffer(&op->tag_buffer, op->mac_length / 8, error, func))
+            return false;
+        const aes_mode_t *m = find_mode(op->block_mode);
+        if (!m) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported block mode %d", static_cast<int>(op->block_mode));
+            *error = KM_ERROR_UNSUPPORTED_BLOCK_MODE;
+            return false;
+        }
+        if (op->padding != KM_PAD_NONE && !(op->padding == KM_PAD_PKCS7 && m->pkcs7)) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Padding %d not usable with block mode %d",
+                        static_cast<int>(op->padding), static_cast<int>(op->block_mode));
+            *error = KM_ERROR_INCOMPATIBLE_PADDING_MODE;
+            return false;
+        }
+        if (keyed_operation(&op->operation, m->algorithm, mode, op->key_size, op->key, tee_call_texts::standard,
+                            func) != TEE_SUCCESS)
+            return false;
+        if (!start_with_nonce(op, *m, in_params, out_params, error, func))
+            return false;
+        if (decrypting && op->padding == KM_PAD_PKCS7 && !hold_back_buffer(&op->last_block, kAesBlock, error, func))
+            return false;
+        return true;
+    }();
+    if (ok)
+        return header;
+    key_param_set_release(out_params);
+    operation_destroy(header, record_state::partial);
+    return nullptr;
+}
+
+bool aes_operation_aad(aes_operation_t *op, keymaster_key_param_set_t *in_params, int32_t *error, const char *func) {
+    const key_param_t *aad = key_param_set_find_unique(in_params, KM_TAG_ASSOCIATED_DATA);
+    if (!aad)
+        return true;
+    if (op->block_mode != KM_MODE_GCM || op->started) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Associated data only with GCM, before any payload");
+        *error = KM_ERROR_INVALID_TAG;
+        return false;
+    }
+    TEE_AEUpdateAAD(op->operation, aad->blob.data, aad->blob.data_length);
+    return true;
+}
+
+TEE_Result aes_cipher_update(aes_operation_t *op, const uint8_t *in, uint32_t len, uint8_t *out, uint32_t *out_len,
+                             const char *func) {
+    if (op->block_mode == KM_MODE_GCM) {
+        TEE_Result res = TEE_AEUpdate(op->operation, in, len, out, out_len);
+        if (res != TEE_SUCCESS)
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AEUpdate failed with 0x%08x\n", res);
+        return res;
+    }
+    TEE_Result res = TEE_CipherUpdate(op->operation, in, len, out, out_len);
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "CipherUpdate failed with 0x%08x\n", res);
+    return res;
+}
+
+TEE_Result aes_cipher_final(aes_operation_t *op, int32_t *error, const char *func) {
+    uint32_t len = 0;
+    TEE_Result res = TEE_CipherDoFinal(op->operation, nullptr, 0, nullptr, &len);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "CipherDoFinal failed with 0x%08x\n", res);
+        return res;
+    }
+    if (len != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "CipherDoFinal make output %dB, expected %dB",
+                    static_cast<int>(len), 0);
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    }
+    return TEE_SUCCESS;
+}
+
+void aes_operation_release(operation_t *header, bool audit) {
+    auto *op = operation_record<aes_operation_t>(header);
+    record_release r(header, audit);
+    r.object(&op->key);
+    r.operation(&op->operation);
+    r.buffer(&op->tag_buffer, op->mac_length / 8, false);
+    r.buffer(&op->last_block, kAesBlock, false);
+}
 
 namespace {
 
@@ -13,30 +419,26 @@ constexpr uint32_t kImportFormats[] = {KM_KEY_FORMAT_RAW};
 // A padding is authorized only for a known block mode; none given means NONE.
 uint32_t aes_get_padding(keymaster_key_param_set_t *in_params, uint32_t *value) {
     uint32_t mode = 0;
-    if (param_getter_block_mode(in_params, &mode) != 0)
-        return 1;
-    if (mode != KM_MODE_ECB && mode != KM_MODE_CBC && mode != KM_MODE_CTR && mode != KM_MODE_GCM)
+    if (param_getter_block_mode(in_params, &mode) != 0 || !find_mode(mode))
         return 1;
     if (param_getter_padding(in_params, value) != 0)
         *value = KM_PAD_NONE;
     return 0;
 }
 
-// Keys and operations are not built into this TA yet: the tables answer
-// capability queries and begin refuses with "purpose not implemented".
-constexpr purpose_ops_t cipher_table() {
+constexpr purpose_ops_t cipher_table(decltype(purpose_ops_t::create_operation) create) {
     // clang-format off
     return purpose_ops_t{.block_mode_count = list_count<kBlockModes>, .get_block_modes = list_write<kBlockModes>,
         .padding_count = list_count<kPaddings>, .get_paddings = list_write<kPaddings>,
         .digest_count = list_count_none, .get_digests = list_write_none,
-        .create_operation = nullptr,
+        .create_operation = create,
         .get_padding = aes_get_padding, .get_block_mode = param_getter_block_mode, .get_digest = param_getter_none,
     };
     // clang-format on
 }
 
-const purpose_ops_t aes_encrypt_ops = cipher_table();
-const purpose_ops_t aes_decrypt_ops = cipher_table();
+const purpose_ops_t aes_encrypt_ops = cipher_table(create_aes_encrypt);
+const purpose_ops_t aes_decrypt_ops = cipher_table(create_aes_decrypt);
 
 } // namespace
 
@@ -46,6 +448,6 @@ const algorithm_provider_t aes_provider = {.algorithm = KM_ALGORITHM_AES, .name 
     .get_purpose_ops = purposes_of<&aes_encrypt_ops, &aes_decrypt_ops>,
     .import_format_count = list_count<kImportFormats>, .get_import_formats = list_write<kImportFormats>,
     .export_format_count = list_count_none, .get_export_formats = list_write_none,
-    .generate_key = nullptr, .import_key = nullptr, .export_key = export_key_unsupported,
+    .generate_key = aes_generate_key, .import_key = aes_import_key, .export_key = export_key_unsupported,
 };
 // clang-format on
