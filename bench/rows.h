@@ -37,6 +37,8 @@ Bytes message(size_t n);
 std::vector<Row> hmac_rows(TaSession &ta);
 // The RSA-2048 rows: PKCS#1 v1.5 and PSS over SHA-256, sign and verify.
 std::vector<Row> rsa_rows(TaSession &ta);
+// The ECDSA rows: P-256 SHA-256 sign and verify, P-384 SHA-384 sign, of 64 bytes.
+std::vector<Row> ec_rows(TaSession &ta);
 // The AES rows: 256-bit GCM of 1 MiB and 1 KiB, 128-bit CBC with PKCS#7 of 1 MiB.
 std::vector<Row> aes_rows(TaSession &ta);
 

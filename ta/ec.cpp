@@ -1,18 +1,430 @@
 /*
- * ec.cpp - the EC provider: capability lists, purpose tables and
- * parameter getters.
+ * ec.cpp - the EC provider: key generation, import, export and key data on
+ * the five NIST prime curves, the capability tables, and the core shared
+ * by the sign and verify twins.
  */
-#include "algorithm_provider.h"
+#include "ec.h"
+
+#include "byte_io.h"
+#include "ta_log.h"
+#include "tee_guard.h"
+
+namespace {
+
+// The key size alone selects the curve and the ECDSA algorithm.
+struct ec_curve_t {
+    uint32_t key_size;
+    uint32_t curve;
+    uint32_t algorithm;
+};
+
+constexpr ec_curve_t kCurves[] = {{192, TEE_ECC_CURVE_NIST_P192, TEE_ALG_ECDSA_P192},
+                                  {224, TEE_ECC_CURVE_NIST_P224, TEE_ALG_ECDSA_P224},
+                                  {256, TEE_ECC_CURVE_NIST_P256, TEE_ALG_ECDSA_P256},
+                                  {384, TEE_ECC_CURVE_NIST_P384, TEE_ALG_ECDSA_P384},
+                                  {521, TEE_ECC_CURVE_NIST_P521, TEE_ALG_ECDSA_P521}};
+
+const ec_curve_t *curve_of(uint32_t key_size) {
+    for (const ec_curve_t &c : kCurves)
+        if (c.key_size == key_size)
+            return &c;
+    return nullptr;
+}
+
+constexpr uint32_t kValues = 3; // x, y, d
+constexpr uint32_t kAttributeIds[kValues] = {TEE_ATTR_ECC_PUBLIC_VALUE_X, TEE_ATTR_ECC_PUBLIC_VALUE_Y,
+                                             TEE_ATTR_ECC_PRIVATE_VALUE};
+
+// The key size and the three length-prefixed values of EC key data (or
+// import material); false (logged in func's name) when cut short.
+struct ec_values_t {
+    uint32_t key_size;
+    const uint8_t *data[kValues];
+    uint32_t len[kValues];
+};
+
+bool read_values(byte_reader *r, ec_values_t *v, const char *func) {
+    if (!r->read_u32(&v->key_size, func))
+        return false;
+    for (uint32_t i = 0; i < kValues; ++i)
+        if (!r->read_lv(&v->data[i], &v->len[i], func))
+            return false;
+    return true;
+}
+
+bool supported_size(uint32_t key_size, const char *func) {
+    if (curve_of(key_size))
+        return true;
+    KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid EC key size %d", static_cast<int>(key_size));
+    return false;
+}
+
+// A fresh key pair on the curve of key_size.
+TEE_Result generate_pair(const ec_curve_t &c, object_guard *obj) {
+    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_ECDSA_KEYPAIR, c.key_size, obj->out());
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    TEE_Attribute curve{};
+    TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, c.curve, 0);
+    res = TEE_GenerateKey(obj->get(), c.key_size, &curve, 1);
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", res);
+    return res;
+}
+
+// Size pass: each value's length read into a one-field scratch buffer, and
+// the key data's total size.
+TEE_Result value_lengths(TEE_ObjectHandle obj, uint32_t key_size, uint32_t lengths[kValues], uint32_t *total,
+                         int32_t *error) {
+    heap_buf scratch(true);
+    if (!scratch.alloc(ec_field_bytes(key_size))) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return TEE_SUCCESS;
+    }
+    *total = 4;
+    for (uint32_t i = 0; i < kValues; ++i) {
+        lengths[i] = scratch.len();
+        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], scratch.get(), &lengths[i]);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
+                        res);
+            return res;
+        }
+        // Each length is at most one field (66 bytes): no overflow.
+        *total += 4 + lengths[i];
+    }
+    return TEE_SUCCESS;
+}
+
+// Second pass: the key size, then each value straight behind its length word.
+TEE_Result write_values(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t lengths[kValues], heap_buf *buf,
+                        int32_t *error) {
+    byte_writer w(buf->get(), buf->len());
+    if (!w.write_u32(key_size, "ec_generate_key"))
+        return TEE_ERROR_GENERIC;
+    for (uint32_t i = 0; i < kValues; ++i) {
+        uint8_t *at = nullptr;
+        if (!w.write_u32(lengths[i], "ec_generate_key") || !w.reserve(lengths[i], &at, "ec_generate_key"))
+            return TEE_ERROR_GENERIC;
+        uint32_t got = lengths[i];
+        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], at, &got);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
+                        res);
+            return res;
+        }
+        if (got != lengths[i]) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Buffer size modified, before %dB, after %dB",
+                        static_cast<int>(lengths[i]), static_cast<int>(got));
+            *error = KM_ERROR_UNKNOWN_ERROR;
+            return TEE_SUCCESS;
+        }
+    }
+    return TEE_SUCCESS;
+}
+
+} // namespace
+
+TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                           int32_t *error) {
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    do {
+        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (!size) {
+            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            break;
+        }
+        if (!supported_size(size->integer, __func__)) {
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        const uint32_t key_size = size->integer;
+        object_guard obj;
+        res = generate_pair(*curve_of(key_size), &obj);
+        if (res != TEE_SUCCESS)
+            break;
+        uint32_t lengths[kValues] = {};
+        uint32_t total = 0;
+        res = value_lengths(obj.get(), key_size, lengths, &total, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        if (!buf.alloc(total)) {
+            KM_ERR("Out of memory");
+            res = TEE_ERROR_OUT_OF_MEMORY;
+            break;
+        }
+        res = write_values(obj.get(), key_size, lengths, &buf, error);
+        done = res == TEE_SUCCESS && *error == KM_ERROR_OK;
+    } while (false);
+    return out.settle(res, done);
+}
+
+TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                         uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
+    key_output out(key_data, key_data_len, error);
+    heap_buf &buf = out.buf;
+    bool done = false;
+    TEE_Result res = TEE_SUCCESS;
+    do {
+        byte_reader r(material, material_len);
+        ec_values_t v{};
+        if (!read_values(&r, &v, __func__)) {
+            res = TEE_ERROR_GENERIC;
+            break;
+        }
+        // Bytes after the private value are not kept.
+        const uint32_t consumed = material_len - r.remaining();
+        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
+        if (res != TEE_SUCCESS || *error)
+            break;
+        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+        if (size && size->integer != v.key_size) {
+            KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
+                   static_cast<int>(v.key_size));
+            *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+            break;
+        }
+        if (!size && (res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, v.key_size))) != TEE_SUCCESS) {
+            KM_ERR("Out of memory");
+            break;
+        }
+        if (!supported_size(v.key_size, __func__)) {
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            break;
+        }
+        if (!buf.alloc(consumed)) {
+            KM_ERR("Out of memory");
+            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+            break;
+        }
+        TEE_MemMove(buf.get(), material, consumed);
+        done = true;
+    } while (false);
+    return out.settle(res, done);
+}
+
+TEE_Result ec_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
+                         int32_t *error) {
+    const uint32_t capacity = *out_len;
+    // Whatever fails, the caller is never told of more bytes than it gave room for.
+    *out_len = 0;
+    *error = KM_ERROR_UNKNOWN_ERROR;
+    byte_reader r(key_data, key_data_len);
+    uint32_t key_size = 0;
+    const uint8_t *x = nullptr;
+    const uint8_t *y = nullptr;
+    uint32_t x_len = 0;
+    uint32_t y_len = 0;
+    if (!r.read_u32(&key_size) || !r.read_lv(&x, &x_len) || !r.read_lv(&y, &y_len))
+        return TEE_SUCCESS;
+    byte_writer w(out, capacity);
+    if (!w.write_u32(key_size) || !w.write_u32(x_len) || !w.write_bytes(x, x_len) || !w.write_u32(y_len) ||
+        !w.write_bytes(y, y_len))
+        return TEE_SUCCESS;
+    *out_len = w.written();
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+TEE_Result ec_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
+                               uint32_t *key_size, int32_t *error) {
+    *object = nullptr;
+    if (key_size)
+        *key_size = 0;
+    byte_reader r(key_data, key_data_len);
+    ec_values_t v{};
+    if (!read_values(&r, &v, __func__))
+        return TEE_ERROR_GENERIC;
+    const ec_curve_t *c = curve_of(v.key_size);
+    if (!c) {
+        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+        return TEE_SUCCESS;
+    }
+    TEE_Attribute attrs[kValues + 1] = {};
+    for (uint32_t i = 0; i < kValues; ++i)
+        TEE_InitRefAttribute(&attrs[i], kAttributeIds[i], v.data[i], v.len[i]);
+    TEE_InitValueAttribute(&attrs[kValues], TEE_ATTR_ECC_CURVE, c->curve, 0);
+    object_guard obj;
+    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_ECDSA_KEYPAIR, v.key_size, obj.out());
+    if (res != TEE_SUCCESS) {
+        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    res = TEE_PopulateTransientObject(obj.get(), attrs, kValues + 1);
+    if (res != TEE_SUCCESS) {
+        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    *object = obj.release();
+    if (key_size)
+        *key_size = v.key_size;
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+/* ---- operations ---------------------------------------------------------- */
+
+namespace {
+
+struct ec_digest_t {
+    uint32_t digest;
+    uint32_t algorithm;
+    uint32_t length;
+};
+
+constexpr ec_digest_t kDigests[] = {{KM_DIGEST_SHA1, TEE_ALG_SHA1, 20},
+                                    {KM_DIGEST_SHA_2_224, TEE_ALG_SHA224, 28},
+                                    {KM_DIGEST_SHA_2_256, TEE_ALG_SHA256, 32},
+                                    {KM_DIGEST_SHA_2_384, TEE_ALG_SHA384, 48},
+                                    {KM_DIGEST_SHA_2_512, TEE_ALG_SHA512, 64}};
+
+// The digest operation of op->digest (none for KM_DIGEST_NONE) and the
+// message buffer's room: false with *error set for a digest ECDSA does not
+// take here, or for a TEE failure (logged, no error).
+bool start_message(ec_operation_t *op, int32_t *error, const char *func) {
+    uint32_t room = ec_field_bytes(op->key_size);
+    if (op->digest == KM_DIGEST_MD5) {
+        *error = KM_ERROR_INCOMPATIBLE_DIGEST;
+        return false;
+    }
+    if (op->digest > KM_DIGEST_SHA_2_512) {
+        *error = KM_ERROR_UNSUPPORTED_DIGEST;
+        return false;
+    }
+    for (const ec_digest_t &d : kDigests) {
+        if (d.digest != op->digest)
+            continue;
+        TEE_Result res = TEE_AllocateOperation(&op->digest_operation, d.algorithm, TEE_MODE_DIGEST, 0);
+        if (res != TEE_SUCCESS) {
+            op->digest_operation = nullptr;
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
+            return false;
+        }
+        room = d.length;
+        op->message_len = room;
+    }
+    op->message = static_cast<uint8_t *>(ta_malloc(room));
+    if (!op->message) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return false;
+    }
+    return true;
+}
+
+// The message buffer's size: the digest's room, or one field unhashed.
+uint32_t message_room(const ec_operation_t *op) {
+    return op->digest == KM_DIGEST_NONE ? ec_field_bytes(op->key_size) : op->message_len;
+}
+
+} // namespace
+
+operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                                 uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func) {
+    operation_t *header = operation_record_alloc(fns, func);
+    if (!header)
+        return nullptr;
+    auto *op = operation_record<ec_operation_t>(header);
+    bool ok = [&] {
+        if (ec_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS || !op->key) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+            return false;
+        }
+        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
+        if (!digest) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
+            *error = KM_ERROR_INVALID_ARGUMENT;
+            return false;
+        }
+        op->digest = digest->enumerated;
+        const ec_curve_t *c = curve_of(op->key_size);
+        if (!c) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported key size %d", static_cast<int>(op->key_size));
+            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+            return false;
+        }
+        return start_message(op, error, func) &&
+               keyed_operation(&op->operation, c->algorithm, mode, op->key_size, op->key, tee_call_texts::standard,
+                               func) == TEE_SUCCESS;
+    }();
+    if (ok)
+        return header;
+    operation_destroy(header, record_state::partial);
+    return nullptr;
+}
+
+TEE_Result ec_operation_update(operation_t *header, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
+                               int32_t *error) {
+    auto *op = operation_record<ec_operation_t>(header);
+    *output_len = 0;
+    if (op->digest_operation) {
+        TEE_DigestUpdate(op->digest_operation, input, *input_len);
+    } else {
+        // Unhashed input beyond one field could not be signed anyway: it is left unconsumed.
+        const uint32_t room = ec_field_bytes(op->key_size) - op->message_len;
+        if (*input_len > room)
+            *input_len = room;
+        if (*input_len)
+            TEE_MemMove(op->message + op->message_len, input, *input_len);
+        op->message_len += *input_len;
+    }
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+uint32_t ec_truncate_digest(uint8_t *buf, uint32_t len, uint32_t key_size) {
+    if (uint64_t{len} * 8 > key_size)
+        len = ec_field_bytes(key_size);
+    if (uint64_t{len} * 8 > key_size) {
+        // P-521: 66 bytes hold 528 bits, the leftmost 521 of them are the value.
+        const uint32_t shift = 8 - key_size % 8;
+        for (uint32_t i = len - 1; i > 0; --i)
+            buf[i] = static_cast<uint8_t>(buf[i] >> shift | buf[i - 1] << (8 - shift));
+        buf[0] = static_cast<uint8_t>(buf[0] >> shift);
+    }
+    return len;
+}
+
+TEE_Result ec_operation_message(ec_operation_t *op, uint32_t *len, const char *func) {
+    *len = op->message_len;
+    if (op->digest_operation) {
+        TEE_Result res = TEE_DigestDoFinal(op->digest_operation, nullptr, 0, op->message, len);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "DigestDoFinal failed with 0x%08x\n", res);
+            return res;
+        }
+    }
+    *len = ec_truncate_digest(op->message, *len, op->key_size);
+    return TEE_SUCCESS;
+}
+
+void ec_operation_release(operation_t *header, bool audit) {
+    auto *op = operation_record<ec_operation_t>(header);
+    record_release r(header, audit);
+    r.object(&op->key);
+    r.operation(&op->operation);
+    r.operation(&op->digest_operation, false);
+    r.buffer(&op->message, message_room(op));
+}
+
+/* ---- the provider --------------------------------------------------------- */
 
 namespace {
 
 constexpr uint32_t kImportFormats[] = {KM_KEY_FORMAT_PKCS8};
 constexpr uint32_t kExportFormats[] = {KM_KEY_FORMAT_X509};
-
-// Keys and operations are not built into this TA yet: the tables answer
-// capability queries and begin refuses with "purpose not implemented".
-const purpose_ops_t ec_sign_ops = digest_signing_table(nullptr);
-const purpose_ops_t ec_verify_ops = digest_signing_table(nullptr);
+const purpose_ops_t ec_sign_ops = digest_signing_table(create_ec_sign);
+const purpose_ops_t ec_verify_ops = digest_signing_table(create_ec_verify);
 
 } // namespace
 
@@ -22,6 +434,6 @@ const algorithm_provider_t ec_provider = {.algorithm = KM_ALGORITHM_EC, .name = 
     .get_purpose_ops = purposes_of<nullptr, nullptr, &ec_sign_ops, &ec_verify_ops>,
     .import_format_count = list_count<kImportFormats>, .get_import_formats = list_write<kImportFormats>,
     .export_format_count = list_count<kExportFormats>, .get_export_formats = list_write<kExportFormats>,
-    .generate_key = nullptr, .import_key = nullptr, .export_key = nullptr,
+    .generate_key = ec_generate_key, .import_key = ec_import_key, .export_key = ec_export_key,
 };
 // clang-format on

@@ -1,0 +1,105 @@
+/*
+ * ec.h - EC keys on the NIST prime curves and ECDSA operations. Key data:
+ * u32 key size in bits (it selects the curve), then x, y and the private
+ * value d, each as u32 length + unsigned big-endian bytes. Import material
+ * is the same layout; export is the key size, x and y.
+ */
+#ifndef EC_H
+#define EC_H
+
+#include "algorithm_provider.h"
+
+/* ec_field_bytes - the bytes of a coordinate and of each signature half: 66 on P-521. */
+constexpr uint32_t ec_field_bytes(uint32_t key_size) {
+    return (key_size + 7) / 8;
+}
+
+/*
+ * ec_generate_key / ec_import_key - the provider's key slots: the
+ * parameters are checked and completed (origin, key size), the key data
+ * returned in a buffer the caller frees. Refusals set *error.
+ */
+TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                           int32_t *error);
+TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                         uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+/*
+ * ec_export_key - the key size, x and y of the key data, with their length
+ * words, into out (capacity *out_len; *out_len the bytes written). Always
+ * TEE_SUCCESS; key data or room cut short is *error -1000 and *out_len 0.
+ */
+TEE_Result ec_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
+                         int32_t *error);
+/*
+ * ec_resolve_key_data - a TEE ECDSA key-pair object from key data; the
+ * attributes point into key_data while the object is populated. On
+ * success *object is a new object the caller frees and *key_size (if
+ * given) its bits. A key size of no supported curve is *error -6 with
+ * TEE_SUCCESS and no object; TEE failures are returned.
+ */
+TEE_Result ec_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
+                               uint32_t *key_size, int32_t *error);
+
+/*
+ * ec_operation_t - the record of an ECDSA signing or verifying operation
+ * (one layout for both): the ECDSA operation and its key, the digest
+ * operation (none for KM_DIGEST_NONE), and the message buffer: the digest
+ * (message_len is its room) or, unhashed, up to one field of input
+ * (message_len is what is buffered).
+ */
+struct ec_operation_t {
+    operation_t header;
+    TEE_OperationHandle operation;
+    TEE_OperationHandle digest_operation;
+    TEE_ObjectHandle key;
+    uint8_t *message;
+    uint32_t message_len;
+    uint32_t digest;
+    uint32_t key_size;
+};
+using ec_sign_operation_t = ec_operation_t;
+using ec_verify_operation_t = ec_operation_t;
+
+/*
+ * Shared cores of the twin files.
+ *
+ * ec_operation_create - a record of fns's kind for the begin parameters:
+ * key object, digest operation, message buffer and the keyed ECDSA
+ * operation in mode. Null on failure, logged in the caller's name, with
+ * *error set where the request is at fault; a TEE failure sets none.
+ */
+operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                                 uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func);
+/*
+ * ec_operation_update - feeds the digest, or buffers unhashed input up to
+ * one field: what does not fit is reported as not consumed. Nothing is
+ * output. Always TEE_SUCCESS.
+ */
+TEE_Result ec_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
+                               int32_t *error);
+/*
+ * ec_operation_message - the value to sign or verify: the digest finished
+ * into the message buffer (its failure logged in the caller's name and
+ * returned), then cut to the key's leftmost bits; *len its length.
+ */
+TEE_Result ec_operation_message(ec_operation_t *op, uint32_t *len, const char *func);
+/*
+ * ec_truncate_digest - keeps the leftmost key_size bits of the len-byte
+ * big-endian value in buf, in place, as ECDSA takes a digest; returns the
+ * new length. Values no longer than the key pass unchanged.
+ */
+uint32_t ec_truncate_digest(uint8_t *buf, uint32_t len, uint32_t key_size);
+/*
+ * ec_operation_release - the release slot of both tables: key object,
+ * ECDSA operation and message buffer, each required of a complete record,
+ * and the optional digest operation.
+ */
+void ec_operation_release(operation_t *op, bool audit);
+
+/* create_ec_sign, create_ec_verify - the create slots of the two tables. */
+operation_t *create_ec_sign(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
+                            keymaster_key_param_set_t *, int32_t *);
+operation_t *create_ec_verify(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
+                              keymaster_key_param_set_t *, int32_t *);
+
+#endif
