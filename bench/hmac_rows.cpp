@@ -20,7 +20,7 @@ constexpr uint32_t kMacBits = 256;
 // A keyed EVP_MAC context made once; each MAC re-initialises it without a
 // key, which restarts from the stored inner and outer pads.
 class RawHmac {
-public:
+  public:
     RawHmac(const Bytes &key, const char *digest) {
         mac_ = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
         ctx_ = mac_ ? EVP_MAC_CTX_new(mac_) : nullptr;
@@ -48,7 +48,7 @@ public:
         return out_;
     }
 
-private:
+  private:
     EVP_MAC *mac_ = nullptr;
     EVP_MAC_CTX *ctx_ = nullptr;
     Bytes out_;
@@ -61,8 +61,8 @@ Bytes fixed_key() {
     return key;
 }
 
-Row hmac_row(TaSession &ta, const Bytes &blob, const std::shared_ptr<RawHmac> &raw, const std::string &size,
-             size_t n, double target) {
+Row hmac_row(TaSession &ta, const Bytes &blob, const std::shared_ptr<RawHmac> &raw, const std::string &size, size_t n,
+             double target) {
     km::ParamSet begin;
     begin.add(KM_TAG_DIGEST, KM_DIGEST_SHA_2_256).add(KM_TAG_MAC_LENGTH, kMacBits);
     auto op = std::make_shared<TaOperation>(ta, KM_PURPOSE_SIGN, blob, begin, message(n));

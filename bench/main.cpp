@@ -35,14 +35,18 @@ namespace {
 
 const RowGroup kRowGroups[] = {hmac_rows, rsa_rows, ec_rows, aes_rows};
 
-std::string ta_name(const Row &r) { return "ta/" + r.algorithm + "/" + r.size; }
-std::string raw_name(const Row &r) { return "raw/" + r.algorithm + "/" + r.size; }
+std::string ta_name(const Row &r) {
+    return "ta/" + r.algorithm + "/" + r.size;
+}
+std::string raw_name(const Row &r) {
+    return "raw/" + r.algorithm + "/" + r.size;
+}
 
 // Prints the usual table and keeps each benchmark's time per operation in
 // seconds: the median aggregate when there are repetitions, else the mean
 // of the plain runs.
 class CapturingReporter : public benchmark::ConsoleReporter {
-public:
+  public:
     // Colour only on a terminal, so that captured output stays plain.
     CapturingReporter() : ConsoleReporter(isatty(STDOUT_FILENO) ? OO_Defaults : OO_Tabular) {}
 
@@ -76,7 +80,7 @@ public:
         return it->second.count ? it->second.sum / it->second.count : -1;
     }
 
-private:
+  private:
     struct Seen {
         double median = -1;
         double sum = 0;

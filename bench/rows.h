@@ -20,10 +20,10 @@
 namespace bench {
 
 struct Row {
-    std::string algorithm; // "hmac_sha256"
-    std::string size;      // "64B": the message
-    int64_t bytes;         // message bytes per operation, for the throughput column
-    double target;         // least raw time / TA time
+    std::string algorithm;     // "hmac_sha256"
+    std::string size;          // "64B": the message
+    int64_t bytes;             // message bytes per operation, for the throughput column
+    double target;             // least raw time / TA time
     std::function<void()> ta;  // one operation through the TA's commands
     std::function<void()> raw; // the same operation on OpenSSL directly
 };

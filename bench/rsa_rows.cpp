@@ -33,11 +33,12 @@ Bytes fresh_pkcs8(EVP_PKEY **pkey) {
 // One preloaded signing or verifying context; each operation hashes the
 // message and signs or verifies the digest.
 class RawRsa {
-public:
+  public:
     RawRsa(EVP_PKEY *key, int padding, bool sign) : sign_(sign) {
         ctx_ = EVP_PKEY_CTX_new_from_pkey(nullptr, key, nullptr);
         int ok = ctx_ && (sign ? EVP_PKEY_sign_init(ctx_) : EVP_PKEY_verify_init(ctx_)) == 1 &&
-                 EVP_PKEY_CTX_set_rsa_padding(ctx_, padding) == 1 && EVP_PKEY_CTX_set_signature_md(ctx_, EVP_sha256()) == 1;
+                 EVP_PKEY_CTX_set_rsa_padding(ctx_, padding) == 1 &&
+                 EVP_PKEY_CTX_set_signature_md(ctx_, EVP_sha256()) == 1;
         if (ok && padding == RSA_PKCS1_PSS_PADDING)
             ok = EVP_PKEY_CTX_set_rsa_pss_saltlen(ctx_, RSA_PSS_SALTLEN_DIGEST) == 1;
         if (!ok)
@@ -60,7 +61,7 @@ public:
         return out_;
     }
 
-private:
+  private:
     EVP_PKEY_CTX *ctx_ = nullptr;
     bool sign_;
     Bytes out_;
@@ -76,8 +77,8 @@ Row rsa_row(TaSession &ta, EVP_PKEY *key, const Bytes &blob, const char *name, u
         TaOperation signer(ta, KM_PURPOSE_SIGN, blob, begin, *msg);
         signature = signer.run();
     }
-    auto op = std::make_shared<TaOperation>(ta, sign ? KM_PURPOSE_SIGN : KM_PURPOSE_VERIFY, blob, begin, *msg,
-                                            signature);
+    auto op =
+        std::make_shared<TaOperation>(ta, sign ? KM_PURPOSE_SIGN : KM_PURPOSE_VERIFY, blob, begin, *msg, signature);
     auto raw = std::make_shared<RawRsa>(key, raw_padding, sign);
     // Both sides must work on the same thing before they are timed: the
     // TA's signature verifies with OpenSSL, OpenSSL's raw signature with the TA.

@@ -48,8 +48,7 @@ TaSession::TaSession() {
     config.trace_level = 0;
     tee_ = std::make_unique<tee_host::Tee>(config);
     tee_->install_ta(&keymaster_ta_header);
-    TEE_Result res =
-        tee_->open_session(keymaster_ta_uuid, tee_host::normal_world_identity(), 0, nullptr, &session_);
+    TEE_Result res = tee_->open_session(keymaster_ta_uuid, tee_host::normal_world_identity(), 0, nullptr, &session_);
     if (res != TEE_SUCCESS) {
         tee_.reset();
         std::error_code ec;

@@ -31,14 +31,14 @@ struct Reply {
 
 // Thrown when the TA refuses: a benchmark of a failing operation means nothing.
 class TaFailure : public std::runtime_error {
-public:
+  public:
     TaFailure(const std::string &what, const Reply &r);
 };
 
 // A fresh TEE with a temporary state directory, silent, with one
 // normal-world session into the Keymaster TA. One per process.
 class TaSession {
-public:
+  public:
     TaSession();
     ~TaSession();
     TaSession(const TaSession &) = delete;
@@ -51,7 +51,7 @@ public:
     // import_key - the key blob for this material; throws when refused.
     Bytes import_key(const km::ParamSet &params, const Bytes &material);
 
-private:
+  private:
     std::filesystem::path state_dir_;
     std::unique_ptr<tee_host::Tee> tee_;
     uint32_t session_ = 0;
@@ -60,7 +60,7 @@ private:
 // One operation on one key, repeatable: the begin, update and finish
 // requests are serialized once, so run() costs only the commands.
 class TaOperation {
-public:
+  public:
     // signature is what finish carries (verification); empty otherwise.
     TaOperation(TaSession &ta, uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params,
                 const Bytes &input, const Bytes &signature = {}, size_t output_capacity = 4096);
@@ -69,7 +69,7 @@ public:
     // update outputs followed by the finish output; throws when refused.
     const Bytes &run();
 
-private:
+  private:
     void update_all(uint32_t handle);
 
     TaSession &ta_;

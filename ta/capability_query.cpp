@@ -59,8 +59,8 @@ TEE_Result count_step(const list_query<Table> &q, uint32_t algorithm, uint32_t p
 }
 
 template <typename Lookup, typename Table>
-TEE_Result list_step(const char *func, const list_query<Table> &q, uint32_t algorithm, uint32_t purpose,
-                     uint8_t *out, uint32_t out_size, int32_t *error) {
+TEE_Result list_step(const char *func, const list_query<Table> &q, uint32_t algorithm, uint32_t purpose, uint8_t *out,
+                     uint32_t out_size, int32_t *error) {
     uint32_t count = 0;
     count_step<Lookup>(q, algorithm, purpose, error, &count);
     if (*error != KM_ERROR_OK)
@@ -102,8 +102,7 @@ TEE_Result get_support_blk_mode_cnt(uint32_t algorithm, uint32_t purpose, int32_
     return count_step<purpose_lookup>(kBlockModes, algorithm, purpose, error, count);
 }
 
-TEE_Result get_support_blk_mode(uint32_t algorithm, uint32_t purpose, uint8_t *out, uint32_t out_size,
-                                int32_t *error) {
+TEE_Result get_support_blk_mode(uint32_t algorithm, uint32_t purpose, uint8_t *out, uint32_t out_size, int32_t *error) {
     return list_step<purpose_lookup>(__func__, kBlockModes, algorithm, purpose, out, out_size, error);
 }
 
@@ -120,8 +119,7 @@ TEE_Result get_support_digest_cnt(uint32_t algorithm, uint32_t purpose, int32_t 
     return count_step<purpose_lookup>(kDigests, algorithm, purpose, error, count);
 }
 
-TEE_Result get_support_digest(uint32_t algorithm, uint32_t purpose, uint8_t *out, uint32_t out_size,
-                              int32_t *error) {
+TEE_Result get_support_digest(uint32_t algorithm, uint32_t purpose, uint8_t *out, uint32_t out_size, int32_t *error) {
     return list_step<purpose_lookup>(__func__, kDigests, algorithm, purpose, out, out_size, error);
 }
 

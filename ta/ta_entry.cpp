@@ -43,15 +43,20 @@ struct command_t {
     handler_fn handler; // null: not built into this TA
 };
 
-int32_t *error_slot(TEE_Param params[4]) { return reinterpret_cast<int32_t *>(&params[0].value.a); }
+int32_t *error_slot(TEE_Param params[4]) {
+    return reinterpret_cast<int32_t *>(&params[0].value.a);
+}
 
-TEE_Result on_algo_cnt(void *, TEE_Param p[4]) { return get_support_algo_cnt(&p[0].value.a); }
+TEE_Result on_algo_cnt(void *, TEE_Param p[4]) {
+    return get_support_algo_cnt(&p[0].value.a);
+}
 TEE_Result on_algo(void *, TEE_Param p[4]) {
     return get_support_algo(static_cast<uint8_t *>(p[2].memref.buffer), p[2].memref.size);
 }
 
 // Commands 3 to 8 take (algorithm = a, purpose = b); 9 to 12 take algorithm = a.
-template <TEE_Result (*F)(uint32_t, uint32_t, int32_t *, uint32_t *)> TEE_Result on_purpose_count(void *, TEE_Param p[4]) {
+template <TEE_Result (*F)(uint32_t, uint32_t, int32_t *, uint32_t *)>
+TEE_Result on_purpose_count(void *, TEE_Param p[4]) {
     uint32_t algorithm = p[0].value.a;
     uint32_t purpose = p[0].value.b;
     return F(algorithm, purpose, error_slot(p), &p[0].value.b);
@@ -71,8 +76,12 @@ template <TEE_Result (*F)(uint32_t, uint8_t *, uint32_t, int32_t *)> TEE_Result 
     return F(algorithm, static_cast<uint8_t *>(p[2].memref.buffer), p[2].memref.size, error_slot(p));
 }
 
-uint8_t *in_buf(TEE_Param p[4]) { return static_cast<uint8_t *>(p[1].memref.buffer); }
-uint8_t *out_buf(TEE_Param p[4]) { return static_cast<uint8_t *>(p[2].memref.buffer); }
+uint8_t *in_buf(TEE_Param p[4]) {
+    return static_cast<uint8_t *>(p[1].memref.buffer);
+}
+uint8_t *out_buf(TEE_Param p[4]) {
+    return static_cast<uint8_t *>(p[2].memref.buffer);
+}
 
 // Commands 13, 15, 19, 20: (request, response and its size, error).
 template <TEE_Result (*F)(const uint8_t *, uint32_t, uint8_t *, uint32_t *, int32_t *)>
@@ -82,8 +91,12 @@ TEE_Result on_request_response(void *, TEE_Param p[4]) {
 TEE_Result on_character_size(void *, TEE_Param p[4]) {
     return get_key_character_size(in_buf(p), p[1].memref.size, error_slot(p), &p[0].value.b);
 }
-TEE_Result on_delete_key(void *, TEE_Param p[4]) { return delete_key(in_buf(p), p[1].memref.size, error_slot(p)); }
-TEE_Result on_delete_all_key(void *, TEE_Param p[4]) { return delete_all_key(error_slot(p)); }
+TEE_Result on_delete_key(void *, TEE_Param p[4]) {
+    return delete_key(in_buf(p), p[1].memref.size, error_slot(p));
+}
+TEE_Result on_delete_all_key(void *, TEE_Param p[4]) {
+    return delete_all_key(error_slot(p));
+}
 TEE_Result on_open_key(void *, TEE_Param p[4]) {
     return open_key_raw(static_cast<uint8_t *>(p[0].memref.buffer), &p[0].memref.size);
 }
@@ -100,13 +113,17 @@ TEE_Result on_update(void *, TEE_Param p[4]) {
 TEE_Result on_finish(void *, TEE_Param p[4]) {
     return finish(p[0].value.a, in_buf(p), p[1].memref.size, out_buf(p), &p[2].memref.size, error_slot(p));
 }
-TEE_Result on_abort(void *, TEE_Param p[4]) { return abort_operation(p[0].value.a, error_slot(p)); }
+TEE_Result on_abort(void *, TEE_Param p[4]) {
+    return abort_operation(p[0].value.a, error_slot(p));
+}
 
 // SOTER commands 0xFF00 to 0xFF03 report their own outcome in a.
 TEE_Result on_soter_generate(void *, TEE_Param p[4]) {
     return soter_handle_generate_attk_key_pair(p[0].value.a, error_slot(p));
 }
-TEE_Result on_soter_verify(void *, TEE_Param p[4]) { return soter_handle_verify_attk_key_pair(error_slot(p)); }
+TEE_Result on_soter_verify(void *, TEE_Param p[4]) {
+    return soter_handle_verify_attk_key_pair(error_slot(p));
+}
 TEE_Result on_soter_export(void *, TEE_Param p[4]) {
     return soter_handle_export_attk_public_key(out_buf(p), &p[2].memref.size, error_slot(p));
 }
@@ -114,14 +131,17 @@ TEE_Result on_soter_device_id(void *, TEE_Param p[4]) {
     return soter_handle_get_device_id(out_buf(p), &p[2].memref.size, error_slot(p));
 }
 
-constexpr uint32_t types(uint32_t t0, uint32_t t1, uint32_t t2) { return TEE_PARAM_TYPES(t0, t1, t2, kParamsNone); }
-constexpr uint32_t kTypesValue = types(kValueInout, kParamsNone, kParamsNone);                              // 0x0003
-constexpr uint32_t kTypesValueOut = types(kValueInout, kParamsNone, TEE_PARAM_TYPE_MEMREF_OUTPUT);          // 0x0603
-constexpr uint32_t kTypesInOut = types(kValueInout, TEE_PARAM_TYPE_MEMREF_INPUT, TEE_PARAM_TYPE_MEMREF_OUTPUT); // 0x0653
-constexpr uint32_t kTypesIn = types(kValueInout, TEE_PARAM_TYPE_MEMREF_INPUT, kParamsNone);                 // 0x0053
-constexpr uint32_t kTypesMemInout = types(TEE_PARAM_TYPE_MEMREF_INOUT, kParamsNone, kParamsNone);          // 0x0007
+constexpr uint32_t types(uint32_t t0, uint32_t t1, uint32_t t2) {
+    return TEE_PARAM_TYPES(t0, t1, t2, kParamsNone);
+}
+constexpr uint32_t kTypesValue = types(kValueInout, kParamsNone, kParamsNone);                     // 0x0003
+constexpr uint32_t kTypesValueOut = types(kValueInout, kParamsNone, TEE_PARAM_TYPE_MEMREF_OUTPUT); // 0x0603
+constexpr uint32_t kTypesInOut =
+    types(kValueInout, TEE_PARAM_TYPE_MEMREF_INPUT, TEE_PARAM_TYPE_MEMREF_OUTPUT);                // 0x0653
+constexpr uint32_t kTypesIn = types(kValueInout, TEE_PARAM_TYPE_MEMREF_INPUT, kParamsNone);       // 0x0053
+constexpr uint32_t kTypesMemInout = types(TEE_PARAM_TYPE_MEMREF_INOUT, kParamsNone, kParamsNone); // 0x0007
 constexpr uint32_t kTypesValOutOut =
-    types(TEE_PARAM_TYPE_VALUE_OUTPUT, kParamsNone, TEE_PARAM_TYPE_MEMREF_OUTPUT); // 0x0602
+    types(TEE_PARAM_TYPE_VALUE_OUTPUT, kParamsNone, TEE_PARAM_TYPE_MEMREF_OUTPUT);              // 0x0602
 constexpr uint32_t kTypesNotify = types(kParamsNone, TEE_PARAM_TYPE_MEMREF_INPUT, kParamsNone); // 0x0050
 
 const command_t kCommands[] = {
@@ -149,7 +169,8 @@ const command_t kCommands[] = {
      on_format_list<get_support_export_format>},
     {KM_CMD_GENERATE_KEY, "generate_key", kTypesInOut, CHECK_AB, false, on_request_response<generate_key>},
     {KM_CMD_GET_KEY_CHARACTER_SIZE, "get_key_character_size", kTypesIn, CHECK_AB, false, on_character_size},
-    {KM_CMD_GET_KEY_CHARACTER, "get_key_character", kTypesInOut, CHECK_AB, false, on_request_response<get_key_character>},
+    {KM_CMD_GET_KEY_CHARACTER, "get_key_character", kTypesInOut, CHECK_AB, false,
+     on_request_response<get_key_character>},
     {KM_CMD_BEGIN, "begin", kTypesInOut, CHECK_B, false, on_begin},
     {KM_CMD_UPDATE, "update", kTypesInOut, CHECK_B, false, on_update},
     {KM_CMD_FINISH, "finish", kTypesInOut, CHECK_B, false, on_finish},
@@ -165,8 +186,7 @@ const command_t kCommands[] = {
      on_soter_verify},
     {KM_CMD_SOTER_EXPORT_ATTK_PUBLIC_KEY, "soter_handle_export_attk_public_key", kTypesValOutOut, CHECK_AB, false,
      on_soter_export},
-    {KM_CMD_SOTER_GET_DEVICE_ID, "soter_handle_get_device_id", kTypesValOutOut, CHECK_AB, false,
-     on_soter_device_id},
+    {KM_CMD_SOTER_GET_DEVICE_ID, "soter_handle_get_device_id", kTypesValOutOut, CHECK_AB, false, on_soter_device_id},
     {KM_CMD_SOTER_SET_FID, "soter_handle_setFid", kTypesNotify, CHECK_NONE, true, nullptr},
 };
 
@@ -234,7 +254,9 @@ const command_t *find_command(uint32_t id) {
     return nullptr;
 }
 
-bool same_uuid(const TEE_UUID &a, const TEE_UUID &b) { return TEE_MemCompare(&a, &b, sizeof a) == 0; }
+bool same_uuid(const TEE_UUID &a, const TEE_UUID &b) {
+    return TEE_MemCompare(&a, &b, sizeof a) == 0;
+}
 
 const bool kSingleInstance = true;
 const bool kMultiSession = true;
@@ -309,7 +331,9 @@ TEE_Result TA_OpenSessionEntryPoint(uint32_t, TEE_Param[4], void **sessionContex
     return TEE_SUCCESS;
 }
 
-void TA_CloseSessionEntryPoint(void *sessionContext) { ta_free(sessionContext); }
+void TA_CloseSessionEntryPoint(void *sessionContext) {
+    ta_free(sessionContext);
+}
 
 TEE_Result TA_InvokeCommandEntryPoint(void *sessionContext, uint32_t commandID, uint32_t paramTypes,
                                       TEE_Param params[4]) {

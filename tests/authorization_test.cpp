@@ -25,7 +25,7 @@ ParamSet sign_params() {
 }
 
 class Authorization : public KeyTest {
-protected:
+  protected:
     void SetUp() override {
         KeyTest::SetUp();
         // Freeze the clocks, then start the instance anew so that its time
@@ -231,8 +231,13 @@ TEST_F(Authorization, TokensAtBeginForKeysWithATimeout) {
         {"field changed", changed_field, KM_ERROR_INVALID_ARGUMENT, nullptr},
         {"68 bytes", Bytes(good.begin(), good.end() - 1), KM_ERROR_INVALID_ARGUMENT,
          "Wrong auth token size, expected 69B, got 68B"},
-        {"70 bytes", [&] { Bytes b = good; b.push_back(0); return b; }(), KM_ERROR_INVALID_ARGUMENT,
-         "Wrong auth token size, expected 69B, got 70B"},
+        {"70 bytes",
+         [&] {
+             Bytes b = good;
+             b.push_back(0);
+             return b;
+         }(),
+         KM_ERROR_INVALID_ARGUMENT, "Wrong auth token size, expected 69B, got 70B"},
         {"version 1", v1, KM_ERROR_INVALID_ARGUMENT, "Wrong auth token version, expected 0, got 1"},
         {"other user", fresh_token(0, kSid + 1), KM_ERROR_KEY_USER_NOT_AUTHENTICATED, "User id mismatch"},
         {"other type", fresh_token(0, kSid, 1), KM_ERROR_KEY_USER_NOT_AUTHENTICATED, "Auth type mismatch"},
@@ -329,12 +334,12 @@ TEST_F(Authorization, ATokenIsRefusedWhenItsMacCannotBeComputed) {
     Bytes forged = mint_token(0, kSid, 0, kFingerprint, tee_host::clock::system_ms());
     std::fill(forged.begin() + 37, forged.end(), 0);
     EXPECT_EQ(try_begin(blob, with_token(forged)).error, KM_ERROR_INVALID_ARGUMENT);
-    int points = sweep_allocations("begin with an all-zero MAC", nullptr,
-                                   [&] { return try_begin(blob, with_token(forged)); },
-                                   {{TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT},
-                                    {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
-                                    {TEE_ERROR_OUT_OF_MEMORY, 0},
-                                    {TEE_ERROR_BAD_PARAMETERS, 0}});
+    int points =
+        sweep_allocations("begin with an all-zero MAC", nullptr, [&] { return try_begin(blob, with_token(forged)); },
+                          {{TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT},
+                           {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
+                           {TEE_ERROR_OUT_OF_MEMORY, 0},
+                           {TEE_ERROR_BAD_PARAMETERS, 0}});
     EXPECT_GT(points, 3);
     tee_host::trace::clear();
     EXPECT_EQ(try_begin(blob).error, KM_ERROR_KEY_USER_NOT_AUTHENTICATED) << "the forged token was cached";

@@ -19,7 +19,7 @@ Bytes le(const List &values) {
 }
 
 class Capability : public TaTest {
-protected:
+  protected:
     struct Answer {
         TEE_Result res;
         int32_t error;
@@ -136,7 +136,7 @@ TEST_F(Capability, UnsupportedPurposesAndAlgorithms) {
         uint32_t algorithm, purpose;
     };
     // No table: AES sign/verify, EC and HMAC encrypt/decrypt, purposes above 3, unknown algorithms.
-    const Case cases[] = {{KM_ALGORITHM_AES, 2}, {KM_ALGORITHM_AES, 3}, {KM_ALGORITHM_EC, 0},  {KM_ALGORITHM_HMAC, 1},
+    const Case cases[] = {{KM_ALGORITHM_AES, 2}, {KM_ALGORITHM_AES, 3}, {KM_ALGORITHM_EC, 0}, {KM_ALGORITHM_HMAC, 1},
                           {KM_ALGORITHM_RSA, 4}, {KM_ALGORITHM_RSA, 7}, {2, KM_PURPOSE_SIGN}, {0, 0}};
     for (const Case &c : cases) {
         for (uint32_t cmd : {3u, 5u, 7u}) {

@@ -313,7 +313,7 @@ TEST(TeeResultNames, RoundTripAndUnknown) {
 
 // Answers each invoke from a script and records what the client sent.
 class ScriptedTransport : public km::Transport {
-public:
+  public:
     struct Sent {
         uint32_t cmd;
         uint32_t types;
@@ -491,7 +491,7 @@ TEST(ClientWire, MalformedAnswers) {
 // ---- the typed client over the embedded TEE ----
 
 class EmbeddedClient : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         char tmpl[] = "/tmp/km-client-XXXXXX";
         ASSERT_NE(mkdtemp(tmpl), nullptr);

@@ -462,7 +462,7 @@ TEST(KeyMaterial, PemArmourReadsBack) {
 
 // Answers each invoke from a script and records the whole request.
 class Script : public km::Transport {
-public:
+  public:
     struct Sent {
         uint32_t cmd, types, a, b;
         Bytes request;             // params[1], when given
@@ -889,7 +889,7 @@ TEST(ClientStream, EveryWayOutEndsTheOperation) {
 // ---- over the embedded TEE ----
 
 class EmbeddedKeys : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         char tmpl[] = "/tmp/km-client-keys-XXXXXX";
         ASSERT_NE(mkdtemp(tmpl), nullptr);

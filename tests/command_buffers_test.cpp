@@ -24,7 +24,7 @@ bool is_memref(uint32_t t) {
 }
 
 class CommandBuffers : public KeyTest {
-protected:
+  protected:
     void SetUp() override {
         KeyTest::SetUp();
         ParamSet rsa;
@@ -117,7 +117,7 @@ protected:
             EXPECT_EQ(p.p[i].memref.buffer, nullptr) << std::hex << cmd;
             if (res != TEE_ERROR_SHORT_BUFFER) {
                 EXPECT_EQ(p.p[i].memref.size, given) << std::hex << "command 0x" << cmd << " size " << std::dec << size
-                                                 << " result 0x" << std::hex << res;
+                                                     << " result 0x" << std::hex << res;
             }
         }
         if (handle)
@@ -174,19 +174,19 @@ TEST_F(CommandBuffers, ShortOutputsNeverReportMoreThanTheirRoom) {
     // A generate that fails after sealing began wipes all the room the
     // caller gave: derivation bytes and nonce never stay behind.
     Bytes in = hmac_params().serialize();
-    int points = sweep_allocations(
-        "generate", nullptr,
-        [&] {
-            Bytes out(4096, 0xEE);
-            Params p = Params::io(0, 0, &in, &out);
-            Outcome r{invoke(KM_CMD_GENERATE_KEY, p), static_cast<int32_t>(p.p[0].value.a)};
-            if (!r.ok()) {
-                EXPECT_EQ(p.p[2].memref.size, 0u);
-                EXPECT_EQ(out, Bytes(4096, 0x00)) << "left behind: " << to_hex(Bytes(out.begin(), out.begin() + 80));
-            }
-            return r;
-        },
-        {{TEE_ERROR_OUT_OF_MEMORY, 0}, {TEE_ERROR_BAD_PARAMETERS, 0}});
+    int points = sweep_allocations("generate", nullptr,
+                                   [&] {
+                                       Bytes out(4096, 0xEE);
+                                       Params p = Params::io(0, 0, &in, &out);
+                                       Outcome r{invoke(KM_CMD_GENERATE_KEY, p), static_cast<int32_t>(p.p[0].value.a)};
+                                       if (!r.ok()) {
+                                           EXPECT_EQ(p.p[2].memref.size, 0u);
+                                           EXPECT_EQ(out, Bytes(4096, 0x00))
+                                               << "left behind: " << to_hex(Bytes(out.begin(), out.begin() + 80));
+                                       }
+                                       return r;
+                                   },
+                                   {{TEE_ERROR_OUT_OF_MEMORY, 0}, {TEE_ERROR_BAD_PARAMETERS, 0}});
     EXPECT_GT(points, 5);
 }
 

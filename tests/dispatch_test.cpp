@@ -35,7 +35,7 @@ bool is_memref(uint32_t t) {
 }
 
 class Dispatch : public TaTest {
-protected:
+  protected:
     // A TEE_Param array whose values carry a mark and whose memory
     // references are empty, so that any write shows.
     Params marked(uint32_t types) {
@@ -252,7 +252,8 @@ TEST_F(Dispatch, TrustedSessionContextAllocationFailureFailsTheOpen) {
     // The fixture's own session keeps the instance alive.
     tee_host::heap::fail_nth(1);
     uint32_t s = 0;
-    TEE_Result res = tee_->open_session(keymaster_ta_uuid, tee_host::ta_identity(trusted_client_uuids[1]), 0, nullptr, &s);
+    TEE_Result res =
+        tee_->open_session(keymaster_ta_uuid, tee_host::ta_identity(trusted_client_uuids[1]), 0, nullptr, &s);
     EXPECT_EQ(res, TEE_ERROR_OUT_OF_MEMORY);
     EXPECT_TRUE(logged(TEE_TRACE_ERROR, "TA_OpenSessionEntryPoint", "Out of memory"));
     EXPECT_TRUE(tee_->instance_alive(keymaster_ta_uuid));

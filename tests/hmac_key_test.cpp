@@ -13,7 +13,7 @@ namespace {
 using km::ParamSet;
 
 class HmacKey : public KeyTest {
-protected:
+  protected:
     // The key data inside a blob, through a trusted TA's raw opening.
     Bytes key_data_of(const Bytes &blob) {
         uint32_t trusted = open(&trusted_client_uuids[0]);
@@ -93,7 +93,8 @@ TEST_F(HmacKey, GenerationRefusals) {
         {"260 bits", hmac_params(260), KM_ERROR_UNSUPPORTED_KEY_SIZE, "Invalid hmac key size 260"},
         {"56 bits", hmac_params(56, 1), KM_ERROR_UNSUPPORTED_KEY_SIZE, "Invalid hmac key size 56"},
         {"no min mac", no_min_mac, KM_ERROR_INVALID_ARGUMENT, "No or too many KM_TAG_MIN_MAC_LENGTH or specified"},
-        {"min mac 60", hmac_params(256, 4, 60), KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH, "Invalid KM_TAG_MIN_MAC_LENGTH 60"},
+        {"min mac 60", hmac_params(256, 4, 60), KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH,
+         "Invalid KM_TAG_MIN_MAC_LENGTH 60"},
         {"min mac 100", hmac_params(256, 4, 100), KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH,
          "Invalid KM_TAG_MIN_MAC_LENGTH 100"},
         {"min mac 264", hmac_params(256, 4, 264), KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH,

@@ -19,7 +19,7 @@ using km::ParamSet;
 const char kKskId[] = "Keymaster KSK";
 
 class KeyBlob : public KeyTest {
-protected:
+  protected:
     // Replaces the stored RPMB KSK while no TA instance runs.
     void plant_ksk(const Bytes &content) {
         tee_->close_session(session_);

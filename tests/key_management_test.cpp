@@ -330,11 +330,36 @@ TEST_F(KeyManagement, AllocationFailuresLeaveNothingBehind) {
         std::vector<Outcome> allowed;
     };
     const Step steps[] = {
-        {"generate", [&] { Bytes b; return generate(hmac_params(), &b); }, {oom, unparsed}},
-        {"import", [&] { Bytes b; return import(hmac_params(), material, &b); }, {oom, unparsed, provider_oom}},
-        {"character size", [&] { uint32_t s = 0; return character_size(key_reference(blob), &s); }, opening},
-        {"characteristics", [&] { Bytes c; return characteristics(key_reference(blob), &c); }, opening},
-        {"export", [&] { Bytes c; return export_key(key_reference(blob), &c); }, opening},
+        {"generate",
+         [&] {
+             Bytes b;
+             return generate(hmac_params(), &b);
+         },
+         {oom, unparsed}},
+        {"import",
+         [&] {
+             Bytes b;
+             return import(hmac_params(), material, &b);
+         },
+         {oom, unparsed, provider_oom}},
+        {"character size",
+         [&] {
+             uint32_t s = 0;
+             return character_size(key_reference(blob), &s);
+         },
+         opening},
+        {"characteristics",
+         [&] {
+             Bytes c;
+             return characteristics(key_reference(blob), &c);
+         },
+         opening},
+        {"export",
+         [&] {
+             Bytes c;
+             return export_key(key_reference(blob), &c);
+         },
+         opening},
     };
     for (const Step &step : steps)
         EXPECT_GT(sweep_allocations(step.name, nullptr, step.run, step.allowed), 0) << step.name;

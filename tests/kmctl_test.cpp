@@ -67,7 +67,7 @@ struct Json {
 };
 
 class JsonReader {
-public:
+  public:
     explicit JsonReader(std::string_view in) : in_(in) {}
 
     // parse - the one value the text holds, or nullopt for anything else.
@@ -81,7 +81,7 @@ public:
         return v;
     }
 
-private:
+  private:
     void skip() {
         while (pos_ < in_.size() && (in_[pos_] == ' ' || in_[pos_] == '\n' || in_[pos_] == '\t' || in_[pos_] == '\r'))
             ++pos_;
@@ -228,7 +228,7 @@ Table parse_table(const std::string &text, std::vector<std::string> *order) {
 }
 
 class Kmctl : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         char tmpl[] = "/tmp/kmctl-test-XXXXXX";
         ASSERT_NE(mkdtemp(tmpl), nullptr);
@@ -585,7 +585,7 @@ Bytes hmac_sha256(const Bytes &key, const Bytes &data) {
 }
 
 class KmctlKeys : public Kmctl {
-protected:
+  protected:
     // km - kmctl on this test's state directory.
     CliRun km(std::vector<std::string> args, const fs::path &stdin_file = "/dev/null") {
         args.insert(args.begin(), {"--state", state_.string()});

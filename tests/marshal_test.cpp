@@ -17,7 +17,7 @@ const Bytes kWorkedExample = hex("02000000"
                                  "616263");
 
 class Marshal : public TaTest {
-protected:
+  protected:
     void TearDown() override {
         key_param_set_release(&set_);
         TaTest::TearDown();
@@ -224,22 +224,21 @@ TEST_F(Marshal, OversizedCountsAndLengths) {
 
 TEST_F(Marshal, MarshalAllocationFailure) {
     build_example(KM_TAG_ASSOCIATED_DATA);
-    int points = sweep_allocations(
-        "marshal", nullptr,
-        [&] {
-            uint8_t *buf = nullptr;
-            uint32_t len = 1;
-            TEE_Result res = marshal(&set_, false, &buf, &len);
-            if (res == TEE_SUCCESS) {
-                ta_free(buf);
-            } else {
-                EXPECT_EQ(buf, nullptr);
-                EXPECT_EQ(len, 0u);
-                EXPECT_TRUE(logged_message("Out of memory, need 55B"));
-            }
-            return Outcome{res, 0};
-        },
-        {{TEE_ERROR_OUT_OF_MEMORY, 0}});
+    int points = sweep_allocations("marshal", nullptr,
+                                   [&] {
+                                       uint8_t *buf = nullptr;
+                                       uint32_t len = 1;
+                                       TEE_Result res = marshal(&set_, false, &buf, &len);
+                                       if (res == TEE_SUCCESS) {
+                                           ta_free(buf);
+                                       } else {
+                                           EXPECT_EQ(buf, nullptr);
+                                           EXPECT_EQ(len, 0u);
+                                           EXPECT_TRUE(logged_message("Out of memory, need 55B"));
+                                       }
+                                       return Outcome{res, 0};
+                                   },
+                                   {{TEE_ERROR_OUT_OF_MEMORY, 0}});
     EXPECT_EQ(points, 1);
     EXPECT_EQ(extra_allocations(), 2u); // the set's own array and data
 }

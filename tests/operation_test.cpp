@@ -31,7 +31,7 @@ ParamSet mac_params(uint32_t mac_bits) {
 }
 
 class Operation : public KeyTest {
-protected:
+  protected:
     Bytes import_hmac(uint32_t digest, const Bytes &key, uint32_t min_mac = 64) {
         ParamSet params;
         params.add(KM_TAG_ALGORITHM, KM_ALGORITHM_HMAC)
@@ -299,17 +299,19 @@ TEST_F(Operation, AllocationFailuresInEveryCommand) {
     const Outcome oom{TEE_ERROR_OUT_OF_MEMORY, 0};
     // A record that cannot be allocated sets no error of its own.
     const Outcome no_record{TEE_SUCCESS, KM_ERROR_UNKNOWN_ERROR};
-    int points = sweep_allocations(
-        "begin", nullptr,
-        [&] {
-            uint32_t h = 0;
-            Outcome o = begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h);
-            if (o.ok())
-                abort(h);
-            return o;
-        },
-        {oom, {TEE_ERROR_BAD_PARAMETERS, 0}, no_record, {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
-         {TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}});
+    int points = sweep_allocations("begin", nullptr,
+                                   [&] {
+                                       uint32_t h = 0;
+                                       Outcome o = begin(KM_PURPOSE_SIGN, blob, mac_params(256), &h);
+                                       if (o.ok())
+                                           abort(h);
+                                       return o;
+                                   },
+                                   {oom,
+                                    {TEE_ERROR_BAD_PARAMETERS, 0},
+                                    no_record,
+                                    {TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED},
+                                    {TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}});
     EXPECT_GT(points, 3);
 
     for (uint32_t cmd : {KM_CMD_UPDATE, KM_CMD_FINISH}) {

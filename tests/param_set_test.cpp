@@ -9,7 +9,7 @@
 namespace {
 
 class ParamSet : public TaTest {
-protected:
+  protected:
     void TearDown() override {
         key_param_set_release(&set_);
         TaTest::TearDown();
@@ -115,16 +115,26 @@ TEST_F(ParamSet, DumpShowsEachTypeAndNeverByteStringContents) {
     }
     const std::vector<std::string> expected = {
         "Dump at caller.cpp:42",
-        "Tag: 0x20000001", "    KM_ENUM: 3",
-        "Tag: 0x10000002", "    KM_ENUM: -1",
-        "Tag: 0x30000003", "    KM_UINT: 0x00000100",
-        "Tag: 0xa00001f6", "    KM_ULONG: 0x1122334455667788",
-        "Tag: 0x60000190", "    KM_DATE: 0x0000000000000010",
-        "Tag: 0x700001f7", "    KM_BOOL: 1",
-        "Tag: 0x90000259", "    KM_BYTES, length 12B",
-        "Tag: 0x80000009", "    KM_BIGNUM, length 0B",
-        "Tag: 0xb0000001", "    Invalid tag type",
-        "Tag: 0x00000000", "    KM_INVALID",
+        "Tag: 0x20000001",
+        "    KM_ENUM: 3",
+        "Tag: 0x10000002",
+        "    KM_ENUM: -1",
+        "Tag: 0x30000003",
+        "    KM_UINT: 0x00000100",
+        "Tag: 0xa00001f6",
+        "    KM_ULONG: 0x1122334455667788",
+        "Tag: 0x60000190",
+        "    KM_DATE: 0x0000000000000010",
+        "Tag: 0x700001f7",
+        "    KM_BOOL: 1",
+        "Tag: 0x90000259",
+        "    KM_BYTES, length 12B",
+        "Tag: 0x80000009",
+        "    KM_BIGNUM, length 0B",
+        "Tag: 0xb0000001",
+        "    Invalid tag type",
+        "Tag: 0x00000000",
+        "    KM_INVALID",
     };
     EXPECT_EQ(got, expected);
 }

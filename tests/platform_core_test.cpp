@@ -35,7 +35,9 @@ TEE_Result probe_create() {
     ++g_creates;
     return g_create_result;
 }
-void probe_destroy() { ++g_destroys; }
+void probe_destroy() {
+    ++g_destroys;
+}
 TEE_Result probe_open(uint32_t, TEE_Param *, void **ctx) {
     *ctx = nullptr;
     return TEE_SUCCESS;
@@ -100,13 +102,13 @@ TEE_Result probe_invoke(void *, uint32_t cmd, uint32_t, TEE_Param p[4]) {
 const uint32_t kProbeData = 0x1000;
 const ta_property_t kProbeProps[] = {{"gpd.ta.dataSize", TA_PROP_U32, &kProbeData},
                                      {"gpd.ta.description", TA_PROP_STRING, "probe"}};
-const ta_header_t kProbeHeader = {kProbeUuid, 0x1000, 0xF,        probe_create, probe_destroy, probe_open,
-                                  probe_close, probe_invoke, nullptr, 0};
-const ta_header_t kProbeWithProps = {kProbeUuid, 0x1000, 0xF, probe_create, probe_destroy, probe_open,
-                                     probe_close, probe_invoke, kProbeProps, 2};
+const ta_header_t kProbeHeader = {kProbeUuid, 0x1000,      0xF,          probe_create, probe_destroy,
+                                  probe_open, probe_close, probe_invoke, nullptr,      0};
+const ta_header_t kProbeWithProps = {kProbeUuid, 0x1000,      0xF,          probe_create, probe_destroy,
+                                     probe_open, probe_close, probe_invoke, kProbeProps,  2};
 
 class Platform : public TaTest {
-protected:
+  protected:
     void SetUp() override {
         TaTest::SetUp();
         g_creates = g_destroys = 0;

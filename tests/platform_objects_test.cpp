@@ -129,8 +129,8 @@ TEST_F(Objects, PopulateRefusesSizesTheTypeOrMaximumDoNotAllow) {
         uint32_t type, max;
         size_t bytes;
     } refused[] = {
-        {TEE_TYPE_AES, 256, 20},          {TEE_TYPE_AES, 128, 32},           {TEE_TYPE_HMAC_SHA256, 1024, 20},
-        {TEE_TYPE_HMAC_SHA1, 512, 65},    {TEE_TYPE_GENERIC_SECRET, 64, 9}, {TEE_TYPE_GENERIC_SECRET, 64, 0},
+        {TEE_TYPE_AES, 256, 20},       {TEE_TYPE_AES, 128, 32},          {TEE_TYPE_HMAC_SHA256, 1024, 20},
+        {TEE_TYPE_HMAC_SHA1, 512, 65}, {TEE_TYPE_GENERIC_SECRET, 64, 9}, {TEE_TYPE_GENERIC_SECRET, 64, 0},
     };
     for (const auto &r : refused) {
         Obj o(r.type, r.max);
@@ -203,7 +203,9 @@ TEST_F(Objects, HandlesAreCountedUntilFreedOrClosed) {
 constexpr TEE_UUID kLeakyUuid = {0x1eaf0001, 0x0002, 0x0003, {4, 5, 6, 7, 8, 9, 10, 11}};
 bool g_leak = false;
 
-TEE_Result leaky_create() { return TEE_SUCCESS; }
+TEE_Result leaky_create() {
+    return TEE_SUCCESS;
+}
 void leaky_destroy() {}
 TEE_Result leaky_open(uint32_t, TEE_Param *, void **ctx) {
     *ctx = nullptr;
@@ -225,8 +227,16 @@ TEE_Result leaky_invoke(void *, uint32_t, uint32_t, TEE_Param *) {
 }
 
 const ta_header_t kLeakyTa = {
-    kLeakyUuid,  0x1000,      TA_FLAG_SINGLE_INSTANCE | TA_FLAG_MULTI_SESSION,
-    leaky_create, leaky_destroy, leaky_open, leaky_close, leaky_invoke, nullptr, 0,
+    kLeakyUuid,
+    0x1000,
+    TA_FLAG_SINGLE_INSTANCE | TA_FLAG_MULTI_SESSION,
+    leaky_create,
+    leaky_destroy,
+    leaky_open,
+    leaky_close,
+    leaky_invoke,
+    nullptr,
+    0,
 };
 
 TEST_F(Objects, HandlesLeftAtInstanceEndAreReportedCountedAndFreed) {
@@ -234,8 +244,7 @@ TEST_F(Objects, HandlesLeftAtInstanceEndAreReportedCountedAndFreed) {
     for (bool leak : {true, false}) {
         g_leak = leak;
         uint32_t session = 0;
-        ASSERT_EQ(tee_->open_session(kLeakyUuid, tee_host::normal_world_identity(), 0, nullptr, &session),
-                  TEE_SUCCESS);
+        ASSERT_EQ(tee_->open_session(kLeakyUuid, tee_host::normal_world_identity(), 0, nullptr, &session), TEE_SUCCESS);
         ASSERT_EQ(tee_->invoke(session, 1, 0, nullptr), TEE_SUCCESS);
         EXPECT_EQ(tee_host::handles::live_objects(), leak ? 1u : 0u);
         EXPECT_EQ(tee_host::handles::live_operations(), leak ? 1u : 0u);

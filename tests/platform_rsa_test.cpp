@@ -183,8 +183,12 @@ using Ctx = std::unique_ptr<EVP_PKEY_CTX, CtxFree>;
 using Attrs = std::vector<std::pair<uint32_t, Bytes>>;
 using AttrList = std::vector<TEE_Attribute>;
 
-uint32_t u32(size_t n) { return static_cast<uint32_t>(n); }
-Bytes text(const char *s) { return Bytes(s, s + std::strlen(s)); }
+uint32_t u32(size_t n) {
+    return static_cast<uint32_t>(n);
+}
+Bytes text(const char *s) {
+    return Bytes(s, s + std::strlen(s));
+}
 
 Bytes random_bytes(size_t n) {
     static std::mt19937 rng(2024);
@@ -202,8 +206,8 @@ Bytes left_pad(const Bytes &b, size_t k) {
 
 // --- The fixed keys as OpenSSL and the platform see them ------------------------
 
-const uint32_t kComponentIds[] = {TEE_ATTR_RSA_MODULUS,  TEE_ATTR_RSA_PUBLIC_EXPONENT, TEE_ATTR_RSA_PRIVATE_EXPONENT,
-                                  TEE_ATTR_RSA_PRIME1,   TEE_ATTR_RSA_PRIME2,          TEE_ATTR_RSA_EXPONENT1,
+const uint32_t kComponentIds[] = {TEE_ATTR_RSA_MODULUS,   TEE_ATTR_RSA_PUBLIC_EXPONENT, TEE_ATTR_RSA_PRIVATE_EXPONENT,
+                                  TEE_ATTR_RSA_PRIME1,    TEE_ATTR_RSA_PRIME2,          TEE_ATTR_RSA_EXPONENT1,
                                   TEE_ATTR_RSA_EXPONENT2, TEE_ATTR_RSA_COEFFICIENT};
 const char *const kComponentNames[] = {OSSL_PKEY_PARAM_RSA_N,         OSSL_PKEY_PARAM_RSA_E,
                                        OSSL_PKEY_PARAM_RSA_D,         OSSL_PKEY_PARAM_RSA_FACTOR1,
@@ -249,9 +253,7 @@ const TestKey &fixed_key(uint32_t bits) {
 
 struct Obj {
     TEE_ObjectHandle h = TEE_HANDLE_NULL;
-    Obj(uint32_t type, uint32_t max_bits) {
-        EXPECT_EQ(TEE_AllocateTransientObject(type, max_bits, &h), TEE_SUCCESS);
-    }
+    Obj(uint32_t type, uint32_t max_bits) { EXPECT_EQ(TEE_AllocateTransientObject(type, max_bits, &h), TEE_SUCCESS); }
     Obj(uint32_t type, uint32_t max_bits, const Attrs &attrs) : Obj(type, max_bits) {
         EXPECT_EQ(populate(attrs), TEE_SUCCESS);
     }
@@ -314,8 +316,8 @@ TEE_Attribute label_attr(const Bytes &label) {
 TEE_Result sign(TEE_OperationHandle op, const Bytes &digest, Bytes *sig, const AttrList &p = {}) {
     sig->assign(1024, 0);
     uint32_t len = u32(sig->size());
-    TEE_Result r = TEE_AsymmetricSignDigest(op, p.data(), u32(p.size()), digest.data(), u32(digest.size()),
-                                            sig->data(), &len);
+    TEE_Result r =
+        TEE_AsymmetricSignDigest(op, p.data(), u32(p.size()), digest.data(), u32(digest.size()), sig->data(), &len);
     sig->resize(r == TEE_SUCCESS ? len : 0);
     return r;
 }
@@ -376,7 +378,8 @@ Ctx sig_ctx(EVP_PKEY *k, bool signing, const SigPadding &s) {
               EVP_PKEY_CTX_set_rsa_padding(ctx.get(), s.padding) == 1 &&
               (!md || EVP_PKEY_CTX_set_signature_md(ctx.get(), md) == 1);
     if (ok && s.padding == RSA_PKCS1_PSS_PADDING)
-        ok = EVP_PKEY_CTX_set_rsa_pss_saltlen(ctx.get(), s.salt) == 1 && EVP_PKEY_CTX_set_rsa_mgf1_md(ctx.get(), md) == 1;
+        ok = EVP_PKEY_CTX_set_rsa_pss_saltlen(ctx.get(), s.salt) == 1 &&
+             EVP_PKEY_CTX_set_rsa_mgf1_md(ctx.get(), md) == 1;
     EXPECT_TRUE(ok);
     return ctx;
 }
@@ -451,7 +454,7 @@ Bytes ossl_raw(EVP_PKEY *k, bool private_op, const Bytes &block) {
 }
 
 class Rsa : public TeeTest {
-protected:
+  protected:
     void start() { restart(); }
 };
 
@@ -501,16 +504,16 @@ TEST_F(Rsa, InconsistentComponentsAreRefusedAndLeaveTheObjectEmpty) {
     auto flip_low_bit = [](Bytes &v) { v.back() ^= 1; };
     auto set = [](Bytes value) { return [value](Bytes &v) { v = value; }; };
     const Attrs bad[] = {
-        with(TEE_ATTR_RSA_MODULUS, flip_low_bit),                        // even modulus
-        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(hex("010002"))),          // even exponent
-        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(hex("01"))),              // e = 1
-        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(key.n())),                // e = n
-        with(TEE_ATTR_RSA_PRIVATE_EXPONENT, set(Bytes{})),               // d = 0
-        with(TEE_ATTR_RSA_PRIVATE_EXPONENT, set(key.n())),               // d = n
-        with(TEE_ATTR_RSA_PRIME1, [](Bytes &v) { v.back() ^= 2; }),      // p q != n
-        with(TEE_ATTR_RSA_EXPONENT1, flip_low_bit),                      // dp != d mod (p-1)
-        with(TEE_ATTR_RSA_EXPONENT2, flip_low_bit),                      // dq != d mod (q-1)
-        with(TEE_ATTR_RSA_COEFFICIENT, flip_low_bit),                    // qinv q != 1 mod p
+        with(TEE_ATTR_RSA_MODULUS, flip_low_bit),                   // even modulus
+        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(hex("010002"))),     // even exponent
+        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(hex("01"))),         // e = 1
+        with(TEE_ATTR_RSA_PUBLIC_EXPONENT, set(key.n())),           // e = n
+        with(TEE_ATTR_RSA_PRIVATE_EXPONENT, set(Bytes{})),          // d = 0
+        with(TEE_ATTR_RSA_PRIVATE_EXPONENT, set(key.n())),          // d = n
+        with(TEE_ATTR_RSA_PRIME1, [](Bytes &v) { v.back() ^= 2; }), // p q != n
+        with(TEE_ATTR_RSA_EXPONENT1, flip_low_bit),                 // dp != d mod (p-1)
+        with(TEE_ATTR_RSA_EXPONENT2, flip_low_bit),                 // dq != d mod (q-1)
+        with(TEE_ATTR_RSA_COEFFICIENT, flip_low_bit),               // qinv q != 1 mod p
     };
     for (size_t i = 0; i < std::size(bad); ++i) {
         Obj o(TEE_TYPE_RSA_KEYPAIR, 1024);
@@ -711,7 +714,8 @@ TEST_F(Rsa, PssSaltLengthFollowsTheSaltAttribute) {
             ASSERT_EQ(sign(s, digest, &sig, c.params), TEE_SUCCESS);
             // OpenSSL checks the salt length exactly when given one.
             EXPECT_TRUE(ossl_verify(exported.get(), {RSA_PKCS1_PSS_PADDING, h.md, c.salt}, digest, sig));
-            EXPECT_FALSE(ossl_verify(exported.get(), {RSA_PKCS1_PSS_PADDING, h.md, c.salt ? c.salt - 1 : 1}, digest, sig));
+            EXPECT_FALSE(
+                ossl_verify(exported.get(), {RSA_PKCS1_PSS_PADDING, h.md, c.salt ? c.salt - 1 : 1}, digest, sig));
             EXPECT_EQ(verify(v, digest, sig, {salt_attr(TEE_RSA_PSS_SALT_MAX_OR_AUTO)}), TEE_SUCCESS);
             EXPECT_EQ(verify(v, digest, sig, {salt_attr(u32(c.salt))}), TEE_SUCCESS);
             EXPECT_EQ(verify(v, digest, sig), c.salt == hlen ? TEE_SUCCESS : TEE_ERROR_SIGNATURE_INVALID);

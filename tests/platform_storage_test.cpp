@@ -22,7 +22,7 @@ constexpr uint32_t kShareWrite = TEE_DATA_FLAG_SHARE_WRITE;
 constexpr uint32_t kAll = kRead | kWrite | kMeta;
 
 class Storage : public TeeTest {
-protected:
+  protected:
     fs::path private_dir() const { return dir_ / "storage" / "private"; }
     std::vector<std::string> files_in(const fs::path &d) const {
         std::vector<std::string> names;
@@ -57,7 +57,9 @@ Bytes read_all(TEE_ObjectHandle h) {
     return out;
 }
 
-Bytes text(const char *s) { return Bytes(s, s + std::strlen(s)); }
+Bytes text(const char *s) {
+    return Bytes(s, s + std::strlen(s));
+}
 
 TEE_ObjectInfo info_of(TEE_ObjectHandle h) {
     TEE_ObjectInfo info{};
@@ -145,8 +147,8 @@ TEST_F(Storage, ObjectsSurviveARestartOfTheTee) {
 TEST_F(Storage, OverwriteReplacesOnlyWhenAskedAndNothingIsOpen) {
     TEE_ObjectHandle h = TEE_HANDLE_NULL, h2 = TEE_HANDLE_NULL;
     ASSERT_EQ(create(TEE_STORAGE_PRIVATE, text("one"), kRead, &h), TEE_SUCCESS);
-    EXPECT_EQ(create(TEE_STORAGE_PRIVATE, text("two"), kRead | TEE_DATA_FLAG_OVERWRITE, &h2),
-              TEE_ERROR_ACCESS_CONFLICT) << "the object is open";
+    EXPECT_EQ(create(TEE_STORAGE_PRIVATE, text("two"), kRead | TEE_DATA_FLAG_OVERWRITE, &h2), TEE_ERROR_ACCESS_CONFLICT)
+        << "the object is open";
     EXPECT_EQ(h2, nullptr);
     TEE_CloseObject(h);
     EXPECT_EQ(create(TEE_STORAGE_PRIVATE, text("two"), kRead, &h2), TEE_ERROR_ACCESS_CONFLICT) << "it exists";
@@ -174,7 +176,7 @@ TEST_F(Storage, SharingRulesDecideWhoMayOpenAlongside) {
         {kRead, kRead, false},
         {kRead | kShareRead, kRead | kShareRead, true},
         {kRead | kShareRead, kRead, false}, // the newcomer must share what the first reads
-        {kRead, kShareRead, true}, // a newcomer that does not read needs no read sharing
+        {kRead, kShareRead, true},          // a newcomer that does not read needs no read sharing
         {kWrite | kShareRead, kRead | kShareWrite, true},
         {kWrite | kShareWrite, kWrite | kShareWrite, true},
         {kWrite | kShareRead, kWrite | kShareWrite, false},
@@ -245,8 +247,8 @@ TEST_F(Storage, UnknownStoragesAndIdentifiers) {
     id64[1] = '/';
     Bytes id63(id64.begin(), id64.end() - 1);
     for (const Bytes *id : {&id64, &id63}) {
-        ASSERT_EQ(TEE_CreatePersistentObject(TEE_STORAGE_PRIVATE, id->data(), static_cast<uint32_t>(id->size()),
-                                             0, TEE_HANDLE_NULL, id->data(), 4, nullptr),
+        ASSERT_EQ(TEE_CreatePersistentObject(TEE_STORAGE_PRIVATE, id->data(), static_cast<uint32_t>(id->size()), 0,
+                                             TEE_HANDLE_NULL, id->data(), 4, nullptr),
                   TEE_SUCCESS);
     }
     EXPECT_EQ(files_in(private_dir()), (std::vector<std::string>{to_hex(id63) + ".obj", to_hex(id64) + ".obj"}));

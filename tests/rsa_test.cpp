@@ -36,7 +36,8 @@ Pkey load_pem(const char *pem) {
 // The TA's import material, made by the client library from the PEM.
 Bytes material_of(const char *pem) {
     std::string why;
-    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)), &why);
+    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)),
+                                     &why);
     EXPECT_TRUE(m.has_value()) << why;
     return m.value_or(Bytes{});
 }
@@ -120,7 +121,7 @@ Bytes sample(size_t n, uint8_t seed) {
 }
 
 class Rsa : public KeyTest {
-protected:
+  protected:
     ParamSet key_params() {
         ParamSet p;
         p.add(KM_TAG_ALGORITHM, KM_ALGORITHM_RSA).add_bool(KM_TAG_NO_AUTH_REQUIRED);
@@ -285,15 +286,17 @@ TEST_F(Rsa, SignaturesInteroperateBothWays) {
             if (!kc.all_digests && d != KM_DIGEST_SHA_2_256)
                 continue;
             Bytes sig;
-            ASSERT_TRUE(ta(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, static_cast<int>(d)), msg, &sig).ok())
+            ASSERT_TRUE(
+                ta(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, static_cast<int>(d)), msg, &sig).ok())
                 << dump_log();
             EXPECT_EQ(sig.size(), static_cast<size_t>(bits / 8));
-            EXPECT_TRUE(openssl(Op::Verify, pub.get(), {RSA_PKCS1_PADDING, md_for(d)}, hash(d, msg), nullptr, sig)) << d;
+            EXPECT_TRUE(openssl(Op::Verify, pub.get(), {RSA_PKCS1_PADDING, md_for(d)}, hash(d, msg), nullptr, sig))
+                << d;
             Bytes theirs;
             ASSERT_TRUE(openssl(Op::Sign, priv.get(), {RSA_PKCS1_PADDING, md_for(d)}, hash(d, msg), &theirs));
             Bytes none;
-            EXPECT_TRUE(ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, static_cast<int>(d)), msg, &none,
-                           theirs)
+            EXPECT_TRUE(ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, static_cast<int>(d)), msg,
+                           &none, theirs)
                             .ok())
                 << d;
             if (d == KM_DIGEST_MD5)
@@ -308,12 +311,14 @@ TEST_F(Rsa, SignaturesInteroperateBothWays) {
                     continue;
                 ASSERT_TRUE(
                     openssl(Op::Sign, priv.get(), {RSA_PKCS1_PSS_PADDING, md_for(d), salt}, hash(d, msg), &theirs));
-                EXPECT_TRUE(ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PSS, static_cast<int>(d)), msg, &none, theirs)
-                                .ok())
+                EXPECT_TRUE(
+                    ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PSS, static_cast<int>(d)), msg, &none, theirs)
+                        .ok())
                     << "PSS " << d << " salt " << salt;
                 theirs[10] ^= 1;
                 EXPECT_EQ(
-                    ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PSS, static_cast<int>(d)), msg, &none, theirs).error,
+                    ta(KM_PURPOSE_VERIFY, blob, op_params(KM_PAD_RSA_PSS, static_cast<int>(d)), msg, &none, theirs)
+                        .error,
                     KM_ERROR_VERIFICATION_FAILED);
             }
         }
@@ -328,7 +333,8 @@ TEST_F(Rsa, PssSaltFollowsTheKeySize) {
     for (auto [d, salt] : {std::pair{KM_DIGEST_SHA_2_512, 128 - 64 - 2}, std::pair{KM_DIGEST_SHA_2_256, 32}}) {
         Bytes sig, digits;
         ASSERT_TRUE(ta(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PSS, static_cast<int>(d)), msg, &sig).ok());
-        EXPECT_TRUE(openssl(Op::Verify, pub.get(), {RSA_PKCS1_PSS_PADDING, md_for(d), salt}, hash(d, msg), nullptr, sig))
+        EXPECT_TRUE(
+            openssl(Op::Verify, pub.get(), {RSA_PKCS1_PSS_PADDING, md_for(d), salt}, hash(d, msg), nullptr, sig))
             << "digest " << d << " salt " << salt;
     }
     Bytes small = import_pem(kRsa512Pem);
@@ -450,9 +456,9 @@ TEST_F(Rsa, DestroyNamesEachMissingMember) {
         keymaster_key_param_set_t in_params{};
         keymaster_key_param_set_t out_params{};
         int32_t error = 0;
-        ASSERT_EQ(open_key(blob.data(), static_cast<uint32_t>(blob.size()), &key_data, &key_data_len, &key_params,
-                           &error),
-                  TEE_SUCCESS);
+        ASSERT_EQ(
+            open_key(blob.data(), static_cast<uint32_t>(blob.size()), &key_data, &key_data_len, &key_params, &error),
+            TEE_SUCCESS);
         Bytes ser = op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, KM_DIGEST_SHA_2_256).serialize();
         ASSERT_EQ(unmarshal(ser.data(), static_cast<uint32_t>(ser.size()), &in_params), TEE_SUCCESS);
         const purpose_ops_t *ops = find_purpose_ops(KM_ALGORITHM_RSA, KM_PURPOSE_SIGN);
@@ -507,7 +513,8 @@ TEST_F(Rsa, CiphertextsInteroperateBothWays) {
         ASSERT_TRUE(ta(KM_PURPOSE_DECRYPT, blob, op_params(c.padding, c.digest), ct, &pt).ok());
         EXPECT_EQ(pt, msg);
         ct[5] ^= 1;
-        EXPECT_EQ(ta(KM_PURPOSE_DECRYPT, blob, op_params(c.padding, c.digest), ct, &pt).error, KM_ERROR_INVALID_ARGUMENT);
+        EXPECT_EQ(ta(KM_PURPOSE_DECRYPT, blob, op_params(c.padding, c.digest), ct, &pt).error,
+                  KM_ERROR_INVALID_ARGUMENT);
     }
     // Raw RSA: always k bytes, leading zeros restored.
     Bytes small(256, 0);

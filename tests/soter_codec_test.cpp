@@ -469,42 +469,40 @@ TEST_F(Codec, PemOfAnRsa2048KeyParsesWithOpenSsl) {
 TEST_F(Codec, AllocationFailuresLeaveNothingBehind) {
     Bytes wire = concat({tlv(17, Bytes(256, 1)), tlv(18, {1, 0, 1}), tlv(19, Bytes(256, 2))});
     const Outcome oom{TEE_ERROR_OUT_OF_MEMORY, 0};
-    int points = sweep_allocations(
-        "tlv_box_parse", nullptr,
-        [&] {
-            tlv_box *box = tlv_box_parse(wire.data(), static_cast<uint32_t>(wire.size()));
-            bool complete = box && box->entries->count == 3;
-            tlv_box_destroy(box);
-            return Outcome{complete ? TEE_SUCCESS : TEE_ERROR_OUT_OF_MEMORY, 0};
-        },
-        {oom});
+    int points = sweep_allocations("tlv_box_parse", nullptr,
+                                   [&] {
+                                       tlv_box *box = tlv_box_parse(wire.data(), static_cast<uint32_t>(wire.size()));
+                                       bool complete = box && box->entries->count == 3;
+                                       tlv_box_destroy(box);
+                                       return Outcome{complete ? TEE_SUCCESS : TEE_ERROR_OUT_OF_MEMORY, 0};
+                                   },
+                                   {oom});
     EXPECT_GT(points, 5);
 
-    points = sweep_allocations(
-        "json render", nullptr,
-        [&] {
-            json_doc *doc = json_doc_create();
-            int rc = json_doc_set_string(doc, "raw", "a/b") | json_doc_set_number(doc, "counter", 2.5);
-            char *text = rc == 0 ? json_doc_render(doc) : nullptr;
-            std::string s = text ? text : "";
-            json_doc_free_text(text);
-            json_doc_free(doc);
-            // Whatever failed, nothing partial comes out.
-            EXPECT_TRUE(s.empty() || s == R"({"raw":"a\/b","counter":2.500000})") << s;
-            return Outcome{s.empty() ? TEE_ERROR_OUT_OF_MEMORY : TEE_SUCCESS, 0};
-        },
-        {oom});
+    points = sweep_allocations("json render", nullptr,
+                               [&] {
+                                   json_doc *doc = json_doc_create();
+                                   int rc = json_doc_set_string(doc, "raw", "a/b") |
+                                            json_doc_set_number(doc, "counter", 2.5);
+                                   char *text = rc == 0 ? json_doc_render(doc) : nullptr;
+                                   std::string s = text ? text : "";
+                                   json_doc_free_text(text);
+                                   json_doc_free(doc);
+                                   // Whatever failed, nothing partial comes out.
+                                   EXPECT_TRUE(s.empty() || s == R"({"raw":"a\/b","counter":2.500000})") << s;
+                                   return Outcome{s.empty() ? TEE_ERROR_OUT_OF_MEMORY : TEE_SUCCESS, 0};
+                               },
+                               {oom});
     EXPECT_GE(points, 5);
 
     Bytes der(294, 0x30);
     Bytes dest(445, 0);
-    points = sweep_allocations(
-        "public_key_to_pem", nullptr,
-        [&] {
-            uint32_t n = 0;
-            return Outcome{public_key_to_pem(der.data(), 294, dest.data(), 445, &n), 0};
-        },
-        {oom});
+    points = sweep_allocations("public_key_to_pem", nullptr,
+                               [&] {
+                                   uint32_t n = 0;
+                                   return Outcome{public_key_to_pem(der.data(), 294, dest.data(), 445, &n), 0};
+                               },
+                               {oom});
     EXPECT_EQ(points, 1);
 }
 

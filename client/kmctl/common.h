@@ -35,18 +35,18 @@ enum ExitCode : int {
 // Failure - ends a subcommand: main prints the message on stderr and
 // exits with the code.
 class Failure : public std::runtime_error {
-public:
+  public:
     Failure(int code, const std::string &message) : std::runtime_error(message), code_(code) {}
     int code() const { return code_; }
 
-private:
+  private:
     int code_;
 };
 
 struct GlobalOptions {
     std::string state_dir;    // when state_given
     bool state_given = false; // otherwise default_state_dir()
-    int trace_level = 1;   // the platform trace threshold, error (1) to flow (4)
+    int trace_level = 1;      // the platform trace threshold, error (1) to flow (4)
 };
 
 // add_global_options - --state and --log-level on the top-level app.
@@ -61,13 +61,13 @@ std::filesystem::path default_state_dir();
 // one after another. Waits for the lock, saying so on stderr after one
 // second. Throws Failure (local) when the lock file cannot be used.
 class StateLock {
-public:
+  public:
     explicit StateLock(const std::filesystem::path &dir);
     ~StateLock();
     StateLock(const StateLock &) = delete;
     StateLock &operator=(const StateLock &) = delete;
 
-private:
+  private:
     int fd_ = -1;
 };
 
@@ -77,11 +77,11 @@ private:
 // the directory cannot be made or locked, TEE failure when the session
 // cannot be opened. One Session per process.
 class Session {
-public:
+  public:
     explicit Session(const GlobalOptions &options);
     km::Client &client() { return client_; }
 
-private:
+  private:
     std::filesystem::path state_dir_;
     StateLock lock_;
     std::unique_ptr<km::EmbeddedTee> tee_;
@@ -131,7 +131,7 @@ std::vector<uint8_t> text_bytes(const std::string &text);
 // large inputs never sit in memory whole. Throws Failure (local) when the
 // file cannot be opened or read.
 class InputStream {
-public:
+  public:
     explicit InputStream(const std::string &path);
     ~InputStream();
     InputStream(const InputStream &) = delete;
@@ -140,7 +140,7 @@ public:
     // read - up to n bytes into buf; fewer only at the end, 0 once it is reached.
     size_t read(uint8_t *buf, size_t n);
 
-private:
+  private:
     int fd_ = -1;
     bool owned_ = false;
     bool at_end_ = false;
@@ -154,7 +154,7 @@ private:
 // removes the temporary and leaves the target as it was. Every failure
 // throws Failure (local) with the reason.
 class OutputStream {
-public:
+  public:
     explicit OutputStream(const std::string &path);
     ~OutputStream();
     OutputStream(const OutputStream &) = delete;
@@ -163,7 +163,7 @@ public:
     void write(std::span<const uint8_t> data);
     void commit();
 
-private:
+  private:
     int fd_ = -1;
     bool owned_ = false;
     std::string name_;   // as the user gave it, for messages

@@ -104,7 +104,8 @@ const EnumTable *table_of(Enumeration e) {
     return nullptr;
 }
 
-#define KM_TAG_ENTRY(tag, values) {tag, #tag, Enumeration::values}
+#define KM_TAG_ENTRY(tag, values)                                                                                      \
+    { tag, #tag, Enumeration::values }
 
 constexpr TagInfo kTags[] = {
     KM_TAG_ENTRY(KM_TAG_PURPOSE, purpose),
@@ -159,7 +160,8 @@ constexpr TypeLabel kTypeLabels[] = {
     {KM_BIGNUM, "bignum"},     {KM_BYTES, "bytes"}, {KM_ULONG_REP, "ulong_rep"},
 };
 
-#define KM_ERROR_ENTRY(code, message) {code, #code, message}
+#define KM_ERROR_ENTRY(code, message)                                                                                  \
+    { code, #code, message }
 
 constexpr ErrorInfo kErrors[] = {
     KM_ERROR_ENTRY(KM_ERROR_OK, "Success."),
@@ -230,7 +232,8 @@ constexpr ErrorInfo kErrors[] = {
 
 #undef KM_ERROR_ENTRY
 
-#define TEE_RESULT_ENTRY(result) {result, #result}
+#define TEE_RESULT_ENTRY(result)                                                                                       \
+    { result, #result }
 
 constexpr TeeResultName kTeeResults[] = {
     TEE_RESULT_ENTRY(TEE_SUCCESS),

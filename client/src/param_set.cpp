@@ -14,7 +14,9 @@ void put_u64(uint8_t *p, uint64_t v) {
     for (int i = 0; i < 8; ++i)
         p[i] = static_cast<uint8_t>(v >> (8 * i));
 }
-uint64_t get_u64(const uint8_t *p) { return uint64_t{get_u32(p)} | uint64_t{get_u32(p + 4)} << 32; }
+uint64_t get_u64(const uint8_t *p) {
+    return uint64_t{get_u32(p)} | uint64_t{get_u32(p + 4)} << 32;
+}
 } // namespace
 
 void put_u32(Bytes &out, uint32_t v) {

@@ -54,9 +54,9 @@
 #define TEE_PARAM_TYPE_MEMREF_OUTPUT 6u
 #define TEE_PARAM_TYPE_MEMREF_INOUT 7u
 
-#define TEE_PARAM_TYPES(t0, t1, t2, t3) \
+#define TEE_PARAM_TYPES(t0, t1, t2, t3)                                                                                \
     ((uint32_t)(t0) | ((uint32_t)(t1) << 4) | ((uint32_t)(t2) << 8) | ((uint32_t)(t3) << 12))
-#define TEE_PARAM_TYPE_GET(t, i) (((uint32_t)(t) >> ((i) * 4)) & 0xFu)
+#define TEE_PARAM_TYPE_GET(t, i) (((uint32_t)(t) >> ((i)*4)) & 0xFu)
 
 /* Login kinds */
 #define TEE_LOGIN_PUBLIC 0x00000000u

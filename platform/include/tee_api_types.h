@@ -69,11 +69,7 @@ typedef struct {
     uint32_t handleFlags;
 } TEE_ObjectInfo;
 
-typedef enum {
-    TEE_DATA_SEEK_SET = 0,
-    TEE_DATA_SEEK_CUR = 1,
-    TEE_DATA_SEEK_END = 2
-} TEE_Whence;
+typedef enum { TEE_DATA_SEEK_SET = 0, TEE_DATA_SEEK_CUR = 1, TEE_DATA_SEEK_END = 2 } TEE_Whence;
 
 typedef enum {
     TEE_MODE_ENCRYPT = 0,

@@ -39,7 +39,7 @@ struct Config {
 // the stand-ins for the provisioning and fingerprint TAs. Its calls are
 // serialised like those of any TA.
 class NativeTa {
-public:
+  public:
     virtual ~NativeTa() = default;
     virtual TEE_UUID uuid() const = 0;
     virtual TEE_Result open_session(const TEE_Identity &client, void **ctx) = 0;
@@ -52,7 +52,7 @@ struct Globals;
 }
 
 class Tee {
-public:
+  public:
     // Tee - starts the emulated TEE. Aborts if another Tee is alive.
     explicit Tee(Config config = {});
     // ~Tee - closes every session (destroying TA instances) and wipes the
@@ -67,8 +67,8 @@ public:
 
     // open_session - opens a session for `client`; creates the TA instance
     // first when none is alive. On success *session holds a nonzero id.
-    TEE_Result open_session(const TEE_UUID &ta, const TEE_Identity &client, uint32_t param_types,
-                            TEE_Param params[4], uint32_t *session);
+    TEE_Result open_session(const TEE_UUID &ta, const TEE_Identity &client, uint32_t param_types, TEE_Param params[4],
+                            uint32_t *session);
     // invoke - TEE_ERROR_BAD_STATE for an unknown session.
     TEE_Result invoke(uint32_t session, uint32_t command, uint32_t param_types, TEE_Param params[4]);
     // close_session - unknown ids are ignored; the last close destroys the instance.
@@ -91,7 +91,7 @@ public:
     // impl_for_detail - for the platform's own sources only.
     detail::Globals &impl_for_detail();
 
-private:
+  private:
     std::unique_ptr<Impl> impl_;
 };
 

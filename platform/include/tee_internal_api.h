@@ -62,8 +62,7 @@ TEE_Result TEE_InvokeTACommand(TEE_TASessionHandle session, uint32_t cancellatio
 /* Transient and generic objects */
 void TEE_GetObjectInfo(TEE_ObjectHandle object, TEE_ObjectInfo *objectInfo);
 TEE_Result TEE_GetObjectInfo1(TEE_ObjectHandle object, TEE_ObjectInfo *objectInfo);
-TEE_Result TEE_GetObjectBufferAttribute(TEE_ObjectHandle object, uint32_t attributeID, void *buffer,
-                                        uint32_t *size);
+TEE_Result TEE_GetObjectBufferAttribute(TEE_ObjectHandle object, uint32_t attributeID, void *buffer, uint32_t *size);
 TEE_Result TEE_GetObjectValueAttribute(TEE_ObjectHandle object, uint32_t attributeID, uint32_t *a, uint32_t *b);
 void TEE_CloseObject(TEE_ObjectHandle object);
 TEE_Result TEE_AllocateTransientObject(uint32_t objectType, uint32_t maxObjectSize, TEE_ObjectHandle *object);
@@ -72,15 +71,14 @@ void TEE_ResetTransientObject(TEE_ObjectHandle object);
 TEE_Result TEE_PopulateTransientObject(TEE_ObjectHandle object, const TEE_Attribute *attrs, uint32_t attrCount);
 void TEE_InitRefAttribute(TEE_Attribute *attr, uint32_t attributeID, const void *buffer, uint32_t length);
 void TEE_InitValueAttribute(TEE_Attribute *attr, uint32_t attributeID, uint32_t a, uint32_t b);
-TEE_Result TEE_GenerateKey(TEE_ObjectHandle object, uint32_t keySize, const TEE_Attribute *params,
-                           uint32_t paramCount);
+TEE_Result TEE_GenerateKey(TEE_ObjectHandle object, uint32_t keySize, const TEE_Attribute *params, uint32_t paramCount);
 
 /* Persistent objects and data streams */
 TEE_Result TEE_OpenPersistentObject(uint32_t storageID, const void *objectID, uint32_t objectIDLen, uint32_t flags,
                                     TEE_ObjectHandle *object);
-TEE_Result TEE_CreatePersistentObject(uint32_t storageID, const void *objectID, uint32_t objectIDLen,
-                                      uint32_t flags, TEE_ObjectHandle attributes, const void *initialData,
-                                      uint32_t initialDataLen, TEE_ObjectHandle *object);
+TEE_Result TEE_CreatePersistentObject(uint32_t storageID, const void *objectID, uint32_t objectIDLen, uint32_t flags,
+                                      TEE_ObjectHandle attributes, const void *initialData, uint32_t initialDataLen,
+                                      TEE_ObjectHandle *object);
 void TEE_CloseAndDeletePersistentObject(TEE_ObjectHandle object);
 TEE_Result TEE_CloseAndDeletePersistentObject1(TEE_ObjectHandle object);
 TEE_Result TEE_ReadObjectData(TEE_ObjectHandle object, void *buffer, uint32_t size, uint32_t *count);
@@ -111,8 +109,8 @@ void TEE_MACInit(TEE_OperationHandle operation, const void *IV, uint32_t IVLen);
 void TEE_MACUpdate(TEE_OperationHandle operation, const void *chunk, uint32_t chunkSize);
 TEE_Result TEE_MACComputeFinal(TEE_OperationHandle operation, const void *message, uint32_t messageLen, void *mac,
                                uint32_t *macLen);
-TEE_Result TEE_MACCompareFinal(TEE_OperationHandle operation, const void *message, uint32_t messageLen,
-                               const void *mac, uint32_t macLen);
+TEE_Result TEE_MACCompareFinal(TEE_OperationHandle operation, const void *message, uint32_t messageLen, const void *mac,
+                               uint32_t macLen);
 
 TEE_Result TEE_AEInit(TEE_OperationHandle operation, const void *nonce, uint32_t nonceLen, uint32_t tagLen,
                       uint32_t AADLen, uint32_t payloadLen);
@@ -128,12 +126,11 @@ TEE_Result TEE_AsymmetricEncrypt(TEE_OperationHandle operation, const TEE_Attrib
                                  const void *srcData, uint32_t srcLen, void *destData, uint32_t *destLen);
 TEE_Result TEE_AsymmetricDecrypt(TEE_OperationHandle operation, const TEE_Attribute *params, uint32_t paramCount,
                                  const void *srcData, uint32_t srcLen, void *destData, uint32_t *destLen);
-TEE_Result TEE_AsymmetricSignDigest(TEE_OperationHandle operation, const TEE_Attribute *params,
-                                    uint32_t paramCount, const void *digest, uint32_t digestLen, void *signature,
-                                    uint32_t *signatureLen);
-TEE_Result TEE_AsymmetricVerifyDigest(TEE_OperationHandle operation, const TEE_Attribute *params,
-                                      uint32_t paramCount, const void *digest, uint32_t digestLen,
-                                      const void *signature, uint32_t signatureLen);
+TEE_Result TEE_AsymmetricSignDigest(TEE_OperationHandle operation, const TEE_Attribute *params, uint32_t paramCount,
+                                    const void *digest, uint32_t digestLen, void *signature, uint32_t *signatureLen);
+TEE_Result TEE_AsymmetricVerifyDigest(TEE_OperationHandle operation, const TEE_Attribute *params, uint32_t paramCount,
+                                      const void *digest, uint32_t digestLen, const void *signature,
+                                      uint32_t signatureLen);
 
 #ifdef __cplusplus
 }

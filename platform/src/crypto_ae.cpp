@@ -23,7 +23,7 @@ constexpr uint32_t kMaxNonce = 128;  // the backend's limit
 constexpr size_t kDefaultNonce = 12; // GCM's own; no length to announce
 
 class AeEngine final : public Engine {
-public:
+  public:
     explicit AeEngine(EVP_CIPHER_CTX *ctx) : ctx_(ctx) {}
     ~AeEngine() override {
         EVP_CIPHER_CTX_free(ctx_);
@@ -123,14 +123,16 @@ public:
 
     size_t tag_len() const { return tag_len_; }
 
-private:
+  private:
     EVP_CIPHER_CTX *ctx_;
     EVP_CIPHER *cipher_ = nullptr;
     size_t tag_len_ = 0; // bytes
     bool payload_started_ = false;
 };
 
-AeEngine &engine(Operation &op) { return static_cast<AeEngine &>(*op.engine); }
+AeEngine &engine(Operation &op) {
+    return static_cast<AeEngine &>(*op.engine);
+}
 
 } // namespace
 
@@ -155,8 +157,8 @@ using namespace tee_host::detail;
 
 extern "C" {
 
-TEE_Result TEE_AEInit(TEE_OperationHandle operation, const void *nonce, uint32_t nonceLen, uint32_t tagLen,
-                      uint32_t, uint32_t) {
+TEE_Result TEE_AEInit(TEE_OperationHandle operation, const void *nonce, uint32_t nonceLen, uint32_t tagLen, uint32_t,
+                      uint32_t) {
     // The AAD and payload lengths matter only to CCM.
     Operation &op = operation_from_handle(operation, TEE_OPERATION_AE, __func__);
     require_key(op, __func__);
@@ -235,8 +237,8 @@ TEE_Result TEE_AEDecryptFinal(TEE_OperationHandle operation, const void *srcData
         return TEE_ERROR_MAC_INVALID;
     }
     SecretBytes plain(srcLen);
-    bool ok = e.decrypt_final(static_cast<const uint8_t *>(srcData), srcLen, plain.data(),
-                              static_cast<const uint8_t *>(tag));
+    bool ok =
+        e.decrypt_final(static_cast<const uint8_t *>(srcData), srcLen, plain.data(), static_cast<const uint8_t *>(tag));
     finish(op);
     if (!ok) {
         *destLen = 0;

@@ -11,7 +11,7 @@ namespace {
 constexpr size_t kBlock = 16;
 
 class CipherEngine final : public Engine {
-public:
+  public:
     CipherEngine(AesMode mode, EVP_CIPHER_CTX *ctx) : mode_(mode), block_mode_(mode != AesMode::Ctr), ctx_(ctx) {}
     ~CipherEngine() override {
         EVP_CIPHER_CTX_free(ctx_);
@@ -83,7 +83,7 @@ public:
             panic("the cipher backend failed to finish");
     }
 
-private:
+  private:
     AesMode mode_;
     bool block_mode_;
     EVP_CIPHER_CTX *ctx_;
@@ -91,7 +91,9 @@ private:
     size_t buffered_ = 0; // input bytes EVP holds until a block is complete
 };
 
-CipherEngine &engine(Operation &op) { return static_cast<CipherEngine &>(*op.engine); }
+CipherEngine &engine(Operation &op) {
+    return static_cast<CipherEngine &>(*op.engine);
+}
 
 } // namespace
 

@@ -9,13 +9,12 @@ namespace tee_host::detail {
 namespace {
 
 constexpr HashInfo kHashes[] = {
-    {"MD5", 16, TEE_TYPE_HMAC_MD5},       {"SHA1", 20, TEE_TYPE_HMAC_SHA1},
-    {"SHA224", 28, TEE_TYPE_HMAC_SHA224}, {"SHA256", 32, TEE_TYPE_HMAC_SHA256},
-    {"SHA384", 48, TEE_TYPE_HMAC_SHA384}, {"SHA512", 64, TEE_TYPE_HMAC_SHA512},
+    {"MD5", 16, TEE_TYPE_HMAC_MD5},       {"SHA1", 20, TEE_TYPE_HMAC_SHA1},     {"SHA224", 28, TEE_TYPE_HMAC_SHA224},
+    {"SHA256", 32, TEE_TYPE_HMAC_SHA256}, {"SHA384", 48, TEE_TYPE_HMAC_SHA384}, {"SHA512", 64, TEE_TYPE_HMAC_SHA512},
 };
 
 class DigestEngine final : public Engine {
-public:
+  public:
     DigestEngine(EVP_MD *md, EVP_MD_CTX *ctx) : md_(md), ctx_(ctx) {}
     ~DigestEngine() override {
         EVP_MD_CTX_free(ctx_);
@@ -54,12 +53,14 @@ public:
         reset();
     }
 
-private:
+  private:
     EVP_MD *md_;
     EVP_MD_CTX *ctx_;
 };
 
-DigestEngine &engine(Operation &op) { return static_cast<DigestEngine &>(*op.engine); }
+DigestEngine &engine(Operation &op) {
+    return static_cast<DigestEngine &>(*op.engine);
+}
 
 } // namespace
 

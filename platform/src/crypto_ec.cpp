@@ -207,7 +207,7 @@ struct SigFree {
 using Sig = std::unique_ptr<ECDSA_SIG, SigFree>;
 
 class EcEngine final : public AsymmetricEngine {
-public:
+  public:
     EcEngine(const Curve &curve, uint32_t mode) : curve_(curve), mode_(mode) {}
     ~EcEngine() override { EVP_PKEY_CTX_free(ctx_); }
     EcEngine(const EcEngine &) = delete;
@@ -233,7 +233,7 @@ public:
     TEE_Result verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
                              size_t digest_len, const uint8_t *sig, size_t sig_len) override;
 
-private:
+  private:
     // context - the operation's signing or verifying context, made on first
     // use and kept until the key changes.
     EVP_PKEY_CTX *context(Operation &op);

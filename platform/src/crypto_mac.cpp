@@ -19,7 +19,8 @@ EVP_MAC_CTX *keyed_ctx(const char *hash, const SecretBytes &key) {
     {
         std::lock_guard<std::mutex> lock(c.mu);
         for (auto &e : c.entries)
-            if (e.hash == hash && e.key.size() == key.size() && CRYPTO_memcmp(e.key.data(), key.data(), key.size()) == 0)
+            if (e.hash == hash && e.key.size() == key.size() &&
+                CRYPTO_memcmp(e.key.data(), key.data(), key.size()) == 0)
                 return EVP_MAC_CTX_dup(e.ctx);
     }
     OSSL_PARAM params[] = {
@@ -47,7 +48,7 @@ EVP_MAC_CTX *keyed_ctx(const char *hash, const SecretBytes &key) {
 constexpr uint32_t kMaxGenericBits = 4096;
 
 class MacEngine final : public Engine {
-public:
+  public:
     MacEngine(const HashInfo &hash, EVP_MAC *mac) : hash_(hash), mac_(mac) {}
     ~MacEngine() override {
         EVP_MAC_CTX_free(ctx_);
@@ -102,13 +103,15 @@ public:
 
     uint32_t size() const { return hash_.size; }
 
-private:
+  private:
     const HashInfo &hash_;
     EVP_MAC *mac_;
     EVP_MAC_CTX *ctx_ = nullptr;
 };
 
-MacEngine &engine(Operation &op) { return static_cast<MacEngine &>(*op.engine); }
+MacEngine &engine(Operation &op) {
+    return static_cast<MacEngine &>(*op.engine);
+}
 
 // The message part of a final call, then the MAC itself.
 void finish_mac(Operation &op, const void *message, uint32_t messageLen, uint8_t *out, const char *fn) {
@@ -129,8 +132,7 @@ TEE_Result mac_setup(Operation &op) {
     const HashInfo *h = hash_info(alg & 0xF);
     // A generic secret may key any HMAC, so its sizes are acceptable too.
     uint32_t max = op.info.maxKeySize;
-    if (!secret_object_type(h->hmac_type)->size_ok(max) &&
-        !(max >= 8 && max <= kMaxGenericBits && max % 8 == 0))
+    if (!secret_object_type(h->hmac_type)->size_ok(max) && !(max >= 8 && max <= kMaxGenericBits && max % 8 == 0))
         return TEE_ERROR_NOT_SUPPORTED;
     EVP_MAC *mac = crypto_state().hmac;
     if (EVP_MAC_up_ref(mac) != 1)
@@ -178,8 +180,8 @@ TEE_Result TEE_MACComputeFinal(TEE_OperationHandle operation, const void *messag
     return TEE_SUCCESS;
 }
 
-TEE_Result TEE_MACCompareFinal(TEE_OperationHandle operation, const void *message, uint32_t messageLen,
-                               const void *mac, uint32_t macLen) {
+TEE_Result TEE_MACCompareFinal(TEE_OperationHandle operation, const void *message, uint32_t messageLen, const void *mac,
+                               uint32_t macLen) {
     Operation &op = operation_from_handle(operation, TEE_OPERATION_MAC, __func__);
     if (macLen && !mac)
         panic("TEE_MACCompareFinal with a null MAC");

@@ -27,7 +27,9 @@ OperationTable &table() {
 }
 
 // The operation class sits in the top nibble of every GP algorithm identifier.
-uint32_t class_of(uint32_t algorithm) { return algorithm >> 28; }
+uint32_t class_of(uint32_t algorithm) {
+    return algorithm >> 28;
+}
 
 TEE_Result setup_by_class(Operation &op) {
     switch (op.info.operationClass) {
@@ -70,7 +72,9 @@ Operation &any_operation(TEE_OperationHandle handle, const char *fn) {
     return *it->second;
 }
 
-bool is_digest(const Operation &op) { return op.info.operationClass == TEE_OPERATION_DIGEST; }
+bool is_digest(const Operation &op) {
+    return op.info.operationClass == TEE_OPERATION_DIGEST;
+}
 
 // Back to the initial state with the key kept; digests are ready at once.
 void to_initial(Operation &op) {
@@ -80,7 +84,9 @@ void to_initial(Operation &op) {
         op.info.handleState &= ~TEE_HANDLE_FLAG_INITIALIZED;
 }
 
-AsymmetricEngine &asymmetric(Operation &op) { return static_cast<AsymmetricEngine &>(*op.engine); }
+AsymmetricEngine &asymmetric(Operation &op) {
+    return static_cast<AsymmetricEngine &>(*op.engine);
+}
 
 } // namespace
 
@@ -120,7 +126,9 @@ void begin(Operation &op) {
     op.active = true;
 }
 
-void finish(Operation &op) { to_initial(op); }
+void finish(Operation &op) {
+    to_initial(op);
+}
 
 const SecretBytes &secret_value(const Operation &op) {
     const Attribute *a = op.key ? find_attribute(*op.key, TEE_ATTR_SECRET_VALUE) : nullptr;
@@ -171,12 +179,12 @@ bool cipher_update(EVP_CIPHER_CTX *ctx, uint8_t *out, const uint8_t *in, size_t 
     return true;
 }
 
-TEE_Result AsymmetricEngine::encrypt(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t,
-                                     uint8_t *, uint32_t *) {
+TEE_Result AsymmetricEngine::encrypt(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t, uint8_t *,
+                                     uint32_t *) {
     panic("TEE_AsymmetricEncrypt not offered by this algorithm");
 }
-TEE_Result AsymmetricEngine::decrypt(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t,
-                                     uint8_t *, uint32_t *) {
+TEE_Result AsymmetricEngine::decrypt(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t, uint8_t *,
+                                     uint32_t *) {
     panic("TEE_AsymmetricDecrypt not offered by this algorithm");
 }
 TEE_Result AsymmetricEngine::sign_digest(Operation &, const TEE_Attribute *, uint32_t, const uint8_t *, size_t,
@@ -222,8 +230,8 @@ using namespace tee_host::detail;
 namespace {
 
 // The asymmetric entry points share their checks.
-Operation &asymmetric_operation(TEE_OperationHandle handle, uint32_t cls, uint32_t mode,
-                                const TEE_Attribute *params, uint32_t count, const char *fn) {
+Operation &asymmetric_operation(TEE_OperationHandle handle, uint32_t cls, uint32_t mode, const TEE_Attribute *params,
+                                uint32_t count, const char *fn) {
     Operation &op = operation_from_handle(handle, cls, fn);
     require_mode(op, mode, fn);
     require_key(op, fn);
@@ -365,21 +373,20 @@ TEE_Result TEE_AsymmetricDecrypt(TEE_OperationHandle operation, const TEE_Attrib
                                   destLen);
 }
 
-TEE_Result TEE_AsymmetricSignDigest(TEE_OperationHandle operation, const TEE_Attribute *params,
-                                    uint32_t paramCount, const void *digest, uint32_t digestLen, void *signature,
-                                    uint32_t *signatureLen) {
+TEE_Result TEE_AsymmetricSignDigest(TEE_OperationHandle operation, const TEE_Attribute *params, uint32_t paramCount,
+                                    const void *digest, uint32_t digestLen, void *signature, uint32_t *signatureLen) {
     Operation &op = asymmetric_operation(operation, TEE_OPERATION_ASYMMETRIC_SIGNATURE, TEE_MODE_SIGN, params,
                                          paramCount, __func__);
     InputView in(digest, digestLen, signature, signatureLen ? *signatureLen : 0, __func__);
     if (!signatureLen)
         panic("TEE_AsymmetricSignDigest with a null signature length");
-    return asymmetric(op).sign_digest(op, params, paramCount, in.data(), in.size(),
-                                      static_cast<uint8_t *>(signature), signatureLen);
+    return asymmetric(op).sign_digest(op, params, paramCount, in.data(), in.size(), static_cast<uint8_t *>(signature),
+                                      signatureLen);
 }
 
-TEE_Result TEE_AsymmetricVerifyDigest(TEE_OperationHandle operation, const TEE_Attribute *params,
-                                      uint32_t paramCount, const void *digest, uint32_t digestLen,
-                                      const void *signature, uint32_t signatureLen) {
+TEE_Result TEE_AsymmetricVerifyDigest(TEE_OperationHandle operation, const TEE_Attribute *params, uint32_t paramCount,
+                                      const void *digest, uint32_t digestLen, const void *signature,
+                                      uint32_t signatureLen) {
     Operation &op = asymmetric_operation(operation, TEE_OPERATION_ASYMMETRIC_SIGNATURE, TEE_MODE_VERIFY, params,
                                          paramCount, __func__);
     if ((digestLen && !digest) || (signatureLen && !signature))

@@ -60,7 +60,9 @@ constexpr Component kComponents[] = {
     {TEE_ATTR_RSA_COEFFICIENT, OSSL_PKEY_PARAM_RSA_COEFFICIENT1, true},
 };
 
-bool rsa_size_ok(uint32_t bits) { return bits >= kMinBits && bits <= kMaxBits && bits % 8 == 0; }
+bool rsa_size_ok(uint32_t bits) {
+    return bits >= kMinBits && bits <= kMaxBits && bits % 8 == 0;
+}
 
 // --- Key objects -----------------------------------------------------------------
 
@@ -86,8 +88,8 @@ TEE_Result check_public(const BIGNUM *n, const BIGNUM *e, uint32_t *bits) {
 // public_key_bits / pair_key_bits - ObjectTypeOps::key_bits of the two
 // types (components already minimal).
 TEE_Result public_key_bits(const AttributeMap &attrs, uint32_t *bits) {
-    return check_public(attr_bn(attrs, TEE_ATTR_RSA_MODULUS).get(),
-                        attr_bn(attrs, TEE_ATTR_RSA_PUBLIC_EXPONENT).get(), bits);
+    return check_public(attr_bn(attrs, TEE_ATTR_RSA_MODULUS).get(), attr_bn(attrs, TEE_ATTR_RSA_PUBLIC_EXPONENT).get(),
+                        bits);
 }
 
 // crt_consistent - whether the CRT values describe the same key as n and
@@ -296,8 +298,7 @@ uint32_t usage_for(uint32_t mode) {
 // operation_param - the one attribute of ID `wanted` among an operation
 // call's params, or null. Any other attribute, or a repeated one, is a TA
 // bug: this algorithm takes nothing else.
-const TEE_Attribute *operation_param(const TEE_Attribute *params, uint32_t count, uint32_t wanted,
-                                     const char *fn) {
+const TEE_Attribute *operation_param(const TEE_Attribute *params, uint32_t count, uint32_t wanted, const char *fn) {
     const TEE_Attribute *found = nullptr;
     for (uint32_t i = 0; i < count; ++i) {
         if (wanted == 0 || params[i].attributeID != wanted || found) {
@@ -312,7 +313,7 @@ const TEE_Attribute *operation_param(const TEE_Attribute *params, uint32_t count
 }
 
 class RsaEngine final : public AsymmetricEngine {
-public:
+  public:
     RsaEngine(Scheme scheme, const HashInfo *hash, uint32_t mode) : scheme_(scheme), hash_(hash), mode_(mode) {}
 
     // Private-key modes need the private half.
@@ -327,17 +328,17 @@ public:
 
     std::unique_ptr<Engine> clone() const override { return std::make_unique<RsaEngine>(scheme_, hash_, mode_); }
 
-    TEE_Result encrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src,
-                       size_t src_len, uint8_t *dst, uint32_t *dst_len) override;
-    TEE_Result decrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src,
-                       size_t src_len, uint8_t *dst, uint32_t *dst_len) override;
+    TEE_Result encrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src, size_t src_len,
+                       uint8_t *dst, uint32_t *dst_len) override;
+    TEE_Result decrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src, size_t src_len,
+                       uint8_t *dst, uint32_t *dst_len) override;
     TEE_Result sign_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
                            size_t digest_len, uint8_t *sig, uint32_t *sig_len) override;
     TEE_Result verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
                              size_t digest_len, const uint8_t *sig, size_t sig_len) override;
     TEE_Result export_key(Operation &op, uint32_t selector, uint8_t *out, uint32_t *len) override;
 
-private:
+  private:
     // pss_salt - the OSSL salt-length parameter the call asks for; false
     // for a salt length no signature can have.
     bool pss_salt(const TEE_Attribute *params, uint32_t count, bool signing, const char *fn, OSSL_PARAM *out,
@@ -354,9 +355,13 @@ private:
 
 // modulus / operation_pkey - the operation key's n, and its prepared form
 // (held by the operation's copy of the key).
-const SecretBytes &modulus(const Operation &op) { return find_attribute(*op.key, TEE_ATTR_RSA_MODULUS)->bytes; }
+const SecretBytes &modulus(const Operation &op) {
+    return find_attribute(*op.key, TEE_ATTR_RSA_MODULUS)->bytes;
+}
 
-EVP_PKEY *operation_pkey(Operation &op) { return object_pkey(*op.key, prepared_key); }
+EVP_PKEY *operation_pkey(Operation &op) {
+    return object_pkey(*op.key, prepared_key);
+}
 
 // context_for - a fresh context on the operation's prepared key; one per
 // call, since each call may set its own padding parameters.
@@ -480,8 +485,8 @@ TEE_Result RsaEngine::decrypt(Operation &op, const TEE_Attribute *params, uint32
     return deliver(out.data() + skip, len - skip, dst, dst_len, fn);
 }
 
-bool RsaEngine::pss_salt(const TEE_Attribute *params, uint32_t count, bool signing, const char *fn,
-                         OSSL_PARAM *out, int *explicit_len) const {
+bool RsaEngine::pss_salt(const TEE_Attribute *params, uint32_t count, bool signing, const char *fn, OSSL_PARAM *out,
+                         int *explicit_len) const {
     const TEE_Attribute *a = operation_param(params, count, TEE_ATTR_RSA_PSS_SALT_LENGTH, fn);
     uint32_t v = a ? a->content.value.a : TEE_RSA_PSS_SALT_DIGEST_LENGTH;
     const char *name = nullptr;
@@ -521,8 +526,8 @@ PkeyCtx RsaEngine::signature_context(Operation &op, bool signing, const OSSL_PAR
     return ctx;
 }
 
-TEE_Result RsaEngine::sign_digest(Operation &op, const TEE_Attribute *params, uint32_t count,
-                                  const uint8_t *digest, size_t digest_len, uint8_t *sig, uint32_t *sig_len) {
+TEE_Result RsaEngine::sign_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
+                                  size_t digest_len, uint8_t *sig, uint32_t *sig_len) {
     const char *fn = "TEE_AsymmetricSignDigest";
     OSSL_PARAM salt = OSSL_PARAM_construct_end();
     int salt_len = 0;
@@ -550,8 +555,8 @@ TEE_Result RsaEngine::sign_digest(Operation &op, const TEE_Attribute *params, ui
     return TEE_SUCCESS;
 }
 
-TEE_Result RsaEngine::verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count,
-                                    const uint8_t *digest, size_t digest_len, const uint8_t *sig, size_t sig_len) {
+TEE_Result RsaEngine::verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
+                                    size_t digest_len, const uint8_t *sig, size_t sig_len) {
     const char *fn = "TEE_AsymmetricVerifyDigest";
     OSSL_PARAM salt = OSSL_PARAM_construct_end();
     int salt_len = 0;
@@ -593,7 +598,9 @@ TEE_Result RsaEngine::export_key(Operation &op, uint32_t selector, uint8_t *out,
 
 } // namespace
 
-const ObjectTypeOps *rsa_object_type(uint32_t type) { return find_type(kRsaTypes, type); }
+const ObjectTypeOps *rsa_object_type(uint32_t type) {
+    return find_type(kRsaTypes, type);
+}
 
 TEE_Result rsa_setup(Operation &op) {
     const Algorithm *alg = nullptr;

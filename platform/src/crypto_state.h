@@ -38,7 +38,7 @@ KeyId key_id(uint32_t type, const AttributeMap &attrs);
 // used first, keyed by key_id. A key seen again skips OpenSSL's per-key
 // set-up (and, for EC, the checks made when the key was first seen).
 class PreparedKeys {
-public:
+  public:
     explicit PreparedKeys(size_t capacity) : capacity_(capacity) {}
     // ~PreparedKeys - frees every key (OpenSSL clears private components
     // as it frees them) and wipes the IDs.
@@ -54,7 +54,7 @@ public:
 
     PreparedKeyStats stats() const;
 
-private:
+  private:
     struct Entry {
         KeyId id;
         EVP_PKEY *pkey;

@@ -19,10 +19,10 @@ namespace tee_host {
 namespace {
 
 struct Installed {
-    const ta_header_t *header = nullptr;     // a TA built against the GP API
-    std::shared_ptr<NativeTa> native;        // or a host-side stand-in
+    const ta_header_t *header = nullptr; // a TA built against the GP API
+    std::shared_ptr<NativeTa> native;    // or a host-side stand-in
     TEE_UUID uuid{};
-    std::mutex mu;                           // one entry-point call at a time
+    std::mutex mu; // one entry-point call at a time
     bool alive = false;
     size_t sessions = 0;
 };
@@ -39,7 +39,7 @@ thread_local const ta_header_t *t_ta = nullptr;
 // Marks the current thread as running inside a TA for a client; nests for
 // TA-to-TA calls.
 class CallScope {
-public:
+  public:
     CallScope(const Installed &ta, const TEE_Identity &client) : client_(t_client), ta_(t_ta) {
         t_client = &client;
         t_ta = ta.header;
@@ -51,12 +51,14 @@ public:
     CallScope(const CallScope &) = delete;
     CallScope &operator=(const CallScope &) = delete;
 
-private:
+  private:
     const TEE_Identity *client_;
     const ta_header_t *ta_;
 };
 
-bool same_uuid(const TEE_UUID &a, const TEE_UUID &b) { return std::memcmp(&a, &b, sizeof a) == 0; }
+bool same_uuid(const TEE_UUID &a, const TEE_UUID &b) {
+    return std::memcmp(&a, &b, sizeof a) == 0;
+}
 
 Tee *g_current = nullptr;
 
@@ -90,8 +92,12 @@ struct Tee::Impl {
 };
 
 namespace detail {
-const TEE_Identity *current_client() { return t_client; }
-const ta_header_t *current_ta() { return t_ta; }
+const TEE_Identity *current_client() {
+    return t_client;
+}
+const ta_header_t *current_ta() {
+    return t_ta;
+}
 Globals &globals() {
     if (!g_current)
         panic("TEE service used with no Tee alive");
@@ -183,13 +189,21 @@ Tee::~Tee() {
     }
 }
 
-Tee *Tee::current() { return g_current; }
-const Config &Tee::config() const { return impl_->globals.config; }
-void Tee::set_rpmb_usable(bool usable) { impl_->globals.rpmb_usable = usable; }
+Tee *Tee::current() {
+    return g_current;
+}
+const Config &Tee::config() const {
+    return impl_->globals.config;
+}
+void Tee::set_rpmb_usable(bool usable) {
+    impl_->globals.rpmb_usable = usable;
+}
 std::vector<uint8_t> Tee::boot_seed() const {
     return {impl_->globals.boot_seed, impl_->globals.boot_seed + sizeof impl_->globals.boot_seed};
 }
-detail::Globals &Tee::impl_for_detail() { return impl_->globals; }
+detail::Globals &Tee::impl_for_detail() {
+    return impl_->globals;
+}
 
 void Tee::install_ta(const ta_header_t *header) {
     auto t = std::make_unique<Installed>();
@@ -354,8 +368,8 @@ TEE_Result TEE_OpenTASession(const TEE_UUID *destination, uint32_t, uint32_t par
     uint32_t id = 0;
     TEE_Result res = g_current->open_session(*destination, ta_identity(self->uuid), paramTypes, params, &id);
     if (returnOrigin)
-        *returnOrigin = res == TEE_ERROR_ITEM_NOT_FOUND || res == TEE_ERROR_ACCESS_DENIED ? TEE_ORIGIN_TEE
-                                                                                           : TEE_ORIGIN_TRUSTED_APP;
+        *returnOrigin =
+            res == TEE_ERROR_ITEM_NOT_FOUND || res == TEE_ERROR_ACCESS_DENIED ? TEE_ORIGIN_TEE : TEE_ORIGIN_TRUSTED_APP;
     *session = res == TEE_SUCCESS ? reinterpret_cast<TEE_TASessionHandle>(static_cast<uintptr_t>(id)) : nullptr;
     return res;
 }

@@ -202,9 +202,13 @@ void *TEE_ReallocAt(void *buffer, uint32_t newSize, const char *file, int line) 
     return reallocate(buffer, newSize, file, line);
 }
 
-void *TEE_Malloc(uint32_t size, uint32_t hint) { return allocate(size, hint, nullptr, 0); }
+void *TEE_Malloc(uint32_t size, uint32_t hint) {
+    return allocate(size, hint, nullptr, 0);
+}
 
-void *TEE_Realloc(void *buffer, uint32_t newSize) { return reallocate(buffer, newSize, nullptr, 0); }
+void *TEE_Realloc(void *buffer, uint32_t newSize) {
+    return reallocate(buffer, newSize, nullptr, 0);
+}
 
 void TEE_Free(void *buffer) {
     if (!buffer)

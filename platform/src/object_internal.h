@@ -51,8 +51,12 @@ using AttributeMap = std::map<uint32_t, Attribute>;
 
 // is_value_attribute / is_public_attribute - what an attribute ID's flag
 // bits say: (a, b) rather than bytes; readable even when not extractable.
-inline bool is_value_attribute(uint32_t id) { return (id & TEE_ATTR_FLAG_VALUE) != 0; }
-inline bool is_public_attribute(uint32_t id) { return (id & TEE_ATTR_FLAG_PUBLIC) != 0; }
+inline bool is_value_attribute(uint32_t id) {
+    return (id & TEE_ATTR_FLAG_VALUE) != 0;
+}
+inline bool is_public_attribute(uint32_t id) {
+    return (id & TEE_ATTR_FLAG_PUBLIC) != 0;
+}
 
 // What the object layer needs to know about one object type.
 struct ObjectTypeOps {

@@ -38,7 +38,9 @@ HandleTable &table() {
 
 constexpr uint32_t kSecretAttrs[] = {TEE_ATTR_SECRET_VALUE};
 
-bool aes_size(uint32_t bits) { return bits == 128 || bits == 192 || bits == 256; }
+bool aes_size(uint32_t bits) {
+    return bits == 128 || bits == 192 || bits == 256;
+}
 
 template <uint32_t Lo, uint32_t Hi> bool bytes_between(uint32_t bits) {
     return bits >= Lo && bits <= Hi && bits % 8 == 0;
@@ -289,7 +291,9 @@ size_t live_objects() {
     std::lock_guard<std::mutex> lock(detail::table().mu);
     return detail::table().objects.size();
 }
-size_t live_operations() { return detail::live_operation_count(); }
+size_t live_operations() {
+    return detail::live_operation_count();
+}
 size_t leaked_at_last_destroy() {
     std::lock_guard<std::mutex> lock(detail::table().mu);
     return detail::table().leaked_at_last_destroy;
@@ -416,8 +420,7 @@ void TEE_GetObjectInfo(TEE_ObjectHandle object, TEE_ObjectInfo *objectInfo) {
     fill_info(obj, objectInfo);
 }
 
-TEE_Result TEE_GetObjectBufferAttribute(TEE_ObjectHandle object, uint32_t attributeID, void *buffer,
-                                        uint32_t *size) {
+TEE_Result TEE_GetObjectBufferAttribute(TEE_ObjectHandle object, uint32_t attributeID, void *buffer, uint32_t *size) {
     Object &obj = object_from_handle(object, __func__);
     if (!size)
         panic("TEE_GetObjectBufferAttribute with a null size");

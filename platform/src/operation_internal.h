@@ -28,7 +28,7 @@ struct Operation;
 // checked the class, so each class must map to one Engine subclass (or, for
 // the asymmetric classes, subclasses of AsymmetricEngine).
 class Engine {
-public:
+  public:
     virtual ~Engine() = default;
     // accepts_key - whether an object of this type can key the operation.
     virtual bool accepts_key(uint32_t object_type) const = 0;
@@ -50,7 +50,7 @@ struct Operation {
     // algorithm, operationClass, mode, digestLength, maxKeySize, keySize,
     // requiredKeyUsage and handleState (TEE_HANDLE_FLAG_*), as reported.
     TEE_OperationInfo info{};
-    bool active = false; // TEE_OPERATION_STATE_ACTIVE
+    bool active = false;         // TEE_OPERATION_STATE_ACTIVE
     std::unique_ptr<Object> key; // the operation's own copy of its key
     std::unique_ptr<Engine> engine;
 };
@@ -98,12 +98,12 @@ bool output_fits(uint32_t *len, size_t needed, const char *fn);
 // that case needs no copy. Panics on null input with a nonzero length,
 // naming fn.
 class InputView {
-public:
+  public:
     InputView(const void *src, size_t len, const void *dst, size_t dst_len, const char *fn, bool in_place = false);
     const uint8_t *data() const { return copy_.empty() ? src_ : copy_.data(); }
     size_t size() const { return len_; }
 
-private:
+  private:
     const uint8_t *src_;
     size_t len_;
     SecretBytes copy_;
@@ -118,7 +118,7 @@ bool cipher_update(EVP_CIPHER_CTX *ctx, uint8_t *out, const uint8_t *in, size_t 
 // identifiers, as OpenSSL names them.
 struct HashInfo {
     const char *name;
-    uint32_t size; // bytes
+    uint32_t size;      // bytes
     uint32_t hmac_type; // the TEE_TYPE_HMAC_* keyed by this hash
 };
 // hash_info - the hash with that GP number, or null.
@@ -133,16 +133,15 @@ const HashInfo *hash_info(uint32_t gp_hash);
 // TEE_ERROR_SHORT_BUFFER. The caller keeps its buffers. Each defaults to a
 // panic, for an engine that does not offer it.
 class AsymmetricEngine : public Engine {
-public:
+  public:
     virtual TEE_Result encrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src,
                                size_t src_len, uint8_t *dst, uint32_t *dst_len);
     virtual TEE_Result decrypt(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *src,
                                size_t src_len, uint8_t *dst, uint32_t *dst_len);
-    virtual TEE_Result sign_digest(Operation &op, const TEE_Attribute *params, uint32_t count,
-                                   const uint8_t *digest, size_t digest_len, uint8_t *sig, uint32_t *sig_len);
-    virtual TEE_Result verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count,
-                                     const uint8_t *digest, size_t digest_len, const uint8_t *sig,
-                                     size_t sig_len);
+    virtual TEE_Result sign_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
+                                   size_t digest_len, uint8_t *sig, uint32_t *sig_len);
+    virtual TEE_Result verify_digest(Operation &op, const TEE_Attribute *params, uint32_t count, const uint8_t *digest,
+                                     size_t digest_len, const uint8_t *sig, size_t sig_len);
     virtual TEE_Result export_key(Operation &op, uint32_t selector, uint8_t *out, uint32_t *len);
 };
 

@@ -143,7 +143,7 @@ SecretBytes serialize(const StoredObject &o, const SecretBytes &data) {
 }
 
 class Reader {
-public:
+  public:
     Reader(const uint8_t *p, size_t n) : p_(p), n_(n) {}
     bool u32(uint32_t *v) {
         if (n_ - pos_ < 4)
@@ -163,7 +163,7 @@ public:
     }
     bool done() const { return pos_ == n_; }
 
-private:
+  private:
     const uint8_t *p_;
     size_t n_;
     size_t pos_ = 0;
@@ -355,7 +355,9 @@ void require_access(const Object &obj, uint32_t flag, const char *fn) {
 
 } // namespace
 
-TEE_Result storage_available(const Object &obj) { return check_storage(obj.storage_id); }
+TEE_Result storage_available(const Object &obj) {
+    return check_storage(obj.storage_id);
+}
 
 uint32_t persistent_data_size(const Object &obj) {
     std::lock_guard<std::mutex> lock(state().mu);
@@ -383,9 +385,9 @@ using namespace tee_host::detail;
 
 extern "C" {
 
-TEE_Result TEE_CreatePersistentObject(uint32_t storageID, const void *objectID, uint32_t objectIDLen,
-                                      uint32_t flags, TEE_ObjectHandle attributes, const void *initialData,
-                                      uint32_t initialDataLen, TEE_ObjectHandle *object) {
+TEE_Result TEE_CreatePersistentObject(uint32_t storageID, const void *objectID, uint32_t objectIDLen, uint32_t flags,
+                                      TEE_ObjectHandle attributes, const void *initialData, uint32_t initialDataLen,
+                                      TEE_ObjectHandle *object) {
     if (object)
         *object = TEE_HANDLE_NULL;
     check_object_id(objectID, objectIDLen, __func__);

@@ -28,18 +28,20 @@ ClockState &state() {
 
 uint64_t running_system_ms(const ClockState &s) {
     auto d = std::chrono::steady_clock::now() - s.start;
-    return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::milliseconds>(d).count() +
-                                 s.system_offset_ms);
+    return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::milliseconds>(d).count() + s.system_offset_ms);
 }
 
 uint64_t running_ree_ms(const ClockState &s) {
     auto now = std::chrono::system_clock::now().time_since_epoch();
-    return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::milliseconds>(now).count() +
-                                 s.ree_offset_ms);
+    return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::milliseconds>(now).count() + s.ree_offset_ms);
 }
 
-uint64_t system_locked(const ClockState &s) { return s.frozen ? s.frozen_system_ms : running_system_ms(s); }
-uint64_t ree_locked(const ClockState &s) { return s.frozen ? s.frozen_ree_ms : running_ree_ms(s); }
+uint64_t system_locked(const ClockState &s) {
+    return s.frozen ? s.frozen_system_ms : running_system_ms(s);
+}
+uint64_t ree_locked(const ClockState &s) {
+    return s.frozen ? s.frozen_ree_ms : running_ree_ms(s);
+}
 
 } // namespace
 

@@ -15,8 +15,8 @@ enum key_protection_t : uint8_t {
     KEY_PROTECTION_RPMB = 1,
 };
 
-constexpr uint32_t kBlobHeaderSize = 93;    // kind, derivation input, nonce, tag
-constexpr uint32_t kBlobOverhead = 101;     // header plus the two length words
+constexpr uint32_t kBlobHeaderSize = 93; // kind, derivation input, nonce, tag
+constexpr uint32_t kBlobOverhead = 101;  // header plus the two length words
 constexpr uint32_t kBlobDeriveOffset = 1;
 constexpr uint32_t kBlobDeriveSize = 64;
 constexpr uint32_t kBlobNonceOffset = 65;

@@ -30,7 +30,9 @@ inline void *ta_realloc(void *p, uint32_t size, const char *file = __builtin_FIL
 }
 
 /* ta_free - releases a block; null is ignored. */
-inline void ta_free(void *p) { TEE_Free(p); }
+inline void ta_free(void *p) {
+    TEE_Free(p);
+}
 
 /* ta_free_wiped - wipes len bytes of a block holding secrets, then frees it. */
 inline void ta_free_wiped(void *p, uint32_t len) {
@@ -45,7 +47,7 @@ inline void ta_free_wiped(void *p, uint32_t len) {
  * is marked secret) when the guard goes out of scope.
  */
 class heap_buf {
-public:
+  public:
     heap_buf() = default;
     explicit heap_buf(bool secret) : secret_(secret) {}
     ~heap_buf() { reset(); }
@@ -85,7 +87,7 @@ public:
     uint32_t len() const { return len_; }
     explicit operator bool() const { return p_ != nullptr; }
 
-private:
+  private:
     uint8_t *p_ = nullptr;
     uint32_t len_ = 0;
     bool secret_ = false;
@@ -93,7 +95,7 @@ private:
 
 /* scope_exit - runs a cleanup when the scope ends, unless dismissed. */
 template <typename F> class scope_exit {
-public:
+  public:
     explicit scope_exit(F f) : f_(std::move(f)) {}
     ~scope_exit() {
         if (armed_)
@@ -103,7 +105,7 @@ public:
     scope_exit &operator=(const scope_exit &) = delete;
     void dismiss() { armed_ = false; }
 
-private:
+  private:
     F f_;
     bool armed_ = true;
 };

@@ -39,7 +39,9 @@ Bytes key_reference(const Bytes &blob, const Bytes &app_id, const Bytes &app_dat
 }
 
 namespace {
-Outcome outcome(TEE_Result res, const Params &p) { return {res, static_cast<int32_t>(p.p[0].value.a)}; }
+Outcome outcome(TEE_Result res, const Params &p) {
+    return {res, static_cast<int32_t>(p.p[0].value.a)};
+}
 } // namespace
 
 Outcome KeyTest::generate(const km::ParamSet &params, Bytes *blob, size_t capacity) {
@@ -51,8 +53,7 @@ Outcome KeyTest::generate(const km::ParamSet &params, Bytes *blob, size_t capaci
     return outcome(res, p);
 }
 
-Outcome KeyTest::import(const km::ParamSet &params, const Bytes &material, Bytes *blob, Bytes *chars,
-                        size_t capacity) {
+Outcome KeyTest::import(const km::ParamSet &params, const Bytes &material, Bytes *blob, Bytes *chars, size_t capacity) {
     Bytes in;
     km::put_lv(in, params.serialize());
     in.insert(in.end(), material.begin(), material.end());

@@ -12,12 +12,11 @@ struct evp_md_st;
 // md_for - OpenSSL's digest for a Keymaster digest (MD5 to SHA-512), null otherwise.
 const evp_md_st *md_for(uint32_t digest);
 
-
 // The three-field key reference of the characteristics and export commands.
 Bytes key_reference(const Bytes &blob, const Bytes &app_id = {}, const Bytes &app_data = {});
 
 class KeyTest : public TaTest {
-protected:
+  protected:
     // generate - command 13; *blob is resized to what the TA wrote.
     Outcome generate(const km::ParamSet &params, Bytes *blob, size_t capacity = 4096);
     // import - command 19; splits the response into blob and characteristics.

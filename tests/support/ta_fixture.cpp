@@ -137,9 +137,8 @@ std::ostream &operator<<(std::ostream &os, const Outcome &o) {
     return os << buf;
 }
 
-int sweep_allocations(const std::string &what, const std::function<void()> &setup,
-                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed,
-                      const std::function<void()> &cleanup) {
+int sweep_allocations(const std::string &what, const std::function<void()> &setup, const std::function<Outcome()> &step,
+                      const std::vector<Outcome> &allowed, const std::function<void()> &cleanup) {
     const size_t base = tee_host::heap::stats().live_count;
     for (int n = 1;; ++n) {
         if (setup)

@@ -33,7 +33,7 @@ struct Params {
 // A bare emulated TEE with no TA installed, on a fresh state directory,
 // for tests of the platform's own services. Ends with no live handle.
 class TeeTest : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override;
     void TearDown() override;
     // restart - a new Tee on the same state directory.
@@ -43,7 +43,7 @@ protected:
 };
 
 class TaTest : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override;
     void TearDown() override;
 
@@ -87,12 +87,13 @@ std::ostream &operator<<(std::ostream &os, const Outcome &o);
 // with no failure armed, may be null), ends whatever step and setup began.
 // Reports each violation with `what` and the failure point; returns the
 // number of failure points visited.
-int sweep_allocations(const std::string &what, const std::function<void()> &setup,
-                      const std::function<Outcome()> &step, const std::vector<Outcome> &allowed,
-                      const std::function<void()> &cleanup = nullptr);
+int sweep_allocations(const std::string &what, const std::function<void()> &setup, const std::function<Outcome()> &step,
+                      const std::vector<Outcome> &allowed, const std::function<void()> &cleanup = nullptr);
 
 Bytes hex(std::string_view s);
 std::string to_hex(const uint8_t *p, size_t n);
-inline std::string to_hex(const Bytes &b) { return to_hex(b.data(), b.size()); }
+inline std::string to_hex(const Bytes &b) {
+    return to_hex(b.data(), b.size());
+}
 
 #endif

@@ -96,7 +96,7 @@ using InputSource = std::function<size_t(uint8_t *buf, size_t n)>;
 using OutputSink = std::function<void(std::span<const uint8_t>)>;
 
 class Client {
-public:
+  public:
     // Client - calls through transport, which the caller opens before the
     // first call and keeps alive as long as the client.
     explicit Client(Transport &transport) : transport_(transport) {}
@@ -175,7 +175,7 @@ public:
     // soter_device_id - command 0xFF03: the device identifier bytes.
     Result<Bytes> soter_device_id();
 
-private:
+  private:
     // Runs a count command then its list command with a buffer of exactly
     // four bytes per entry.
     Result<ValueList> count_then_list(uint32_t count_cmd, uint32_t list_cmd, uint32_t algorithm, uint32_t purpose);

@@ -18,7 +18,7 @@ class Tee;
 namespace km {
 
 class EmbeddedTee final : public Transport {
-public:
+  public:
     // EmbeddedTee - starts the emulated TEE with its persistent state in
     // state_dir (created when missing) and platform trace lines up to
     // trace_level on stderr, and installs the Keymaster TA. The emulation
@@ -37,7 +37,7 @@ public:
     // tee - the emulated TEE itself, for callers that drive the platform.
     tee_host::Tee &tee() { return *tee_; }
 
-private:
+  private:
     std::unique_ptr<tee_host::Tee> tee_;
     uint32_t session_ = 0; // 0: no session open
 };

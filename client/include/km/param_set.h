@@ -23,10 +23,12 @@ struct Param {
     Bytes bytes;        // byte strings and big numbers
 };
 
-inline bool tag_is_bytes(uint32_t tag) { return tag_type(tag) == 0x80000000u || tag_type(tag) == 0x90000000u; }
+inline bool tag_is_bytes(uint32_t tag) {
+    return tag_type(tag) == 0x80000000u || tag_type(tag) == 0x90000000u;
+}
 
 class ParamSet {
-public:
+  public:
     ParamSet &add(uint32_t tag, uint64_t value);
     ParamSet &add_bool(uint32_t tag) { return add(tag, 1); }
     ParamSet &add_bytes(uint32_t tag, Bytes bytes);
@@ -43,7 +45,7 @@ public:
     // find - the first parameter with that tag, or null.
     const Param *find(uint32_t tag) const;
 
-private:
+  private:
     std::vector<Param> params_;
 };
 

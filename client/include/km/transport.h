@@ -13,7 +13,7 @@
 namespace km {
 
 class Transport {
-public:
+  public:
     virtual ~Transport() = default;
 
     // open - opens a session to the Keymaster TA. TEE_SUCCESS, or the TEE's
