@@ -164,120 +164,99 @@ bool hold_back_buffer(uint8_t **buf, uint32_t len, int32_t *error, const char *f
 
 TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+            if (!size) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
+                            "No or too many KM_TAG_KEY_SIZE or specified");
+                *error = KM_ERROR_INVALID_ARGUMENT;
+                return false;
+            }
+            const uint32_t key_size = size->integer;
+            if (!valid_key_size(key_size)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Invalid AES key size %d",
+                            static_cast<int>(key_size));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            check_min_mac_length(params, error, "aes_generate_key");
+            if (*error)
+                return false;
 
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (!size) {
-            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const uint32_t key_size = size->integer;
-        if (!valid_key_size(key_size)) {
-            KM_ERR("Invalid AES key size %d", static_cast<int>(key_size));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        check_min_mac_length(params, error, __func__);
-        if (*error)
-            break;
-
-        object_guard obj;
-        res = TEE_AllocateTransientObject(TEE_TYPE_AES, key_size, obj.out());
-        if (res != TEE_SUCCESS) {
-            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
-            break;
-        }
-        res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GenerateKey failed with 0x%08x\n", res);
-            break;
-        }
-        const uint32_t key_bytes = key_size / 8;
-        if (!buf.alloc(kKeyDataHeader + key_bytes)) {
-            KM_ERR("Out of memory");
-            res = TEE_ERROR_OUT_OF_MEMORY;
-            break;
-        }
-        byte_writer w(buf.get(), buf.len());
-        uint8_t *key = nullptr;
-        if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        uint32_t got = key_bytes;
-        res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, key, &got);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
-            break;
-        }
-        if (got != key_bytes) {
-            KM_ERR("Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes), static_cast<int>(got));
-            *error = KM_ERROR_UNKNOWN_ERROR;
-            break;
-        }
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+            object_guard obj;
+            *res = TEE_AllocateTransientObject(TEE_TYPE_AES, key_size, obj.out());
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
+                            "AllocateTransientObject failed with 0x%08x\n", *res);
+                return false;
+            }
+            *res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", *res);
+                return false;
+            }
+            const uint32_t key_bytes = key_size / 8;
+            if (!buf->alloc(kKeyDataHeader + key_bytes)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Out of memory");
+                *res = TEE_ERROR_OUT_OF_MEMORY;
+                return false;
+            }
+            byte_writer w(buf->get(), buf->len());
+            uint8_t *key = nullptr;
+            if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
+                *res = TEE_ERROR_GENERIC;
+                return false;
+            }
+            uint32_t got = key_bytes;
+            *res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, key, &got);
+            if (*res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
+                            "GetObjectBufferAttribute failed with 0x%08x\n", *res);
+                return false;
+            }
+            if (got != key_bytes) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
+                            "Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes),
+                            static_cast<int>(got));
+                *error = KM_ERROR_UNKNOWN_ERROR;
+                return false;
+            }
+            return true;
+        });
 }
 
 TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
-            KM_ERR("Invalid AES key size %d", -1);
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        const uint32_t guessed = material_len * 8;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (size) {
-            if (size->integer != guessed) {
-                KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
-                       static_cast<int>(guessed));
-                *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
-                break;
+    return provider_key_slot(
+        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Invalid AES key size %d", -1);
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
             }
-        } else {
-            res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
-            if (res != TEE_SUCCESS) {
-                KM_ERR("Out of memory");
-                break;
+            const uint32_t guessed = material_len * 8;
+            *res = provider_check_key_size(params, guessed, error, "aes_import_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            if (!valid_key_size(guessed)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Invalid AES key size %d",
+                            static_cast<int>(guessed));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
             }
-        }
-        if (!valid_key_size(guessed)) {
-            KM_ERR("Invalid AES key size %d", static_cast<int>(guessed));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        if (!buf.alloc(kKeyDataHeader + material_len)) {
-            KM_ERR("Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
-        }
-        byte_writer w(buf.get(), buf.len());
-        if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+            if (!buf->alloc(kKeyDataHeader + material_len)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Out of memory");
+                *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+                return false;
+            }
+            byte_writer w(buf->get(), buf->len());
+            if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
+                *res = TEE_ERROR_GENERIC;
+                return false;
+            }
+            return true;
+        });
 }
 
 TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
@@ -290,20 +269,9 @@ TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, 
     const uint8_t *key = nullptr;
     if (!r.read_u32(&bits) || !r.read_bytes(bits / 8, &key))
         return TEE_ERROR_GENERIC;
-    TEE_Attribute attr{};
-    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
-    object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_AES, bits, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+    TEE_Result res = secret_key_object(TEE_TYPE_AES, bits, key, object);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *object = obj.release();
     if (key_size)
         *key_size = bits;
     *error = KM_ERROR_OK;

@@ -130,43 +130,37 @@ TEE_Result write_values(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t 
 
 TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                            int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-    do {
-        res = provider_set_origin(params, KM_ORIGIN_GENERATED, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (!size) {
-            KM_ERR("No or too many KM_TAG_KEY_SIZE or specified");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        if (!supported_size(size->integer, __func__)) {
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        const uint32_t key_size = size->integer;
-        object_guard obj;
-        res = generate_pair(*curve_of(key_size), &obj);
-        if (res != TEE_SUCCESS)
-            break;
-        uint32_t lengths[kValues] = {};
-        uint32_t total = 0;
-        res = value_lengths(obj.get(), key_size, lengths, &total, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (!buf.alloc(total)) {
-            KM_ERR("Out of memory");
-            res = TEE_ERROR_OUT_OF_MEMORY;
-            break;
-        }
-        res = write_values(obj.get(), key_size, lengths, &buf, error);
-        done = res == TEE_SUCCESS && *error == KM_ERROR_OK;
-    } while (false);
-    return out.settle(res, done);
+    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
+                             [&](heap_buf *buf, TEE_Result *res) {
+                                 const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+                                 if (!size) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__,
+                                                 "No or too many KM_TAG_KEY_SIZE or specified");
+                                     *error = KM_ERROR_INVALID_ARGUMENT;
+                                     return false;
+                                 }
+                                 if (!supported_size(size->integer, "ec_generate_key")) {
+                                     *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                                     return false;
+                                 }
+                                 const uint32_t key_size = size->integer;
+                                 object_guard obj;
+                                 *res = generate_pair(*curve_of(key_size), &obj);
+                                 if (*res != TEE_SUCCESS)
+                                     return false;
+                                 uint32_t lengths[kValues] = {};
+                                 uint32_t total = 0;
+                                 *res = value_lengths(obj.get(), key_size, lengths, &total, error);
+                                 if (*res != TEE_SUCCESS || *error)
+                                     return false;
+                                 if (!buf->alloc(total)) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Out of memory");
+                                     *res = TEE_ERROR_OUT_OF_MEMORY;
+                                     return false;
+                                 }
+                                 *res = write_values(obj.get(), key_size, lengths, buf, error);
+                                 return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+                             });
 }
 
 TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
@@ -184,20 +178,12 @@ TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *mater
         }
         // Bytes after the private value are not kept.
         const uint32_t consumed = material_len - r.remaining();
-        res = provider_set_origin(params, KM_ORIGIN_IMPORTED, error);
+        res = out.start(params, KM_ORIGIN_IMPORTED);
         if (res != TEE_SUCCESS || *error)
             break;
-        const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-        if (size && size->integer != v.key_size) {
-            KM_ERR("Key size mismatch (given %d, guessed %d)", static_cast<int>(size->integer),
-                   static_cast<int>(v.key_size));
-            *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+        res = provider_check_key_size(params, v.key_size, error);
+        if (res != TEE_SUCCESS || *error)
             break;
-        }
-        if (!size && (res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, v.key_size))) != TEE_SUCCESS) {
-            KM_ERR("Out of memory");
-            break;
-        }
         if (!supported_size(v.key_size, __func__)) {
             *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
             break;

@@ -172,7 +172,7 @@ TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *mat
                 return false;
             }
             const uint32_t guessed = material_len * 8;
-            *res = provider_check_key_size(params, guessed, error);
+            *res = provider_check_key_size(params, guessed, error, "hmac_import_key");
             if (*res != TEE_SUCCESS || *error)
                 return false;
             if (!valid_bit_length(guessed)) {
@@ -205,20 +205,9 @@ TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len,
     const uint8_t *key = nullptr;
     if (!r.read_u32(&bits) || !r.read_u32(&type) || !r.read_bytes(bits / 8, &key))
         return TEE_ERROR_GENERIC;
-    TEE_Attribute attr{};
-    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
-    object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(type, bits, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+    TEE_Result res = secret_key_object(type, bits, key, object);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *object = obj.release();
     *key_type = type;
     if (key_size)
         *key_size = bits;

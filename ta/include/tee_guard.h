@@ -48,6 +48,32 @@ using persistent_guard = tee_handle_guard<TEE_ObjectHandle, TEE_CloseObject>;
 /* operation_guard - an operation, freed. */
 using operation_guard = tee_handle_guard<TEE_OperationHandle, TEE_FreeOperation>;
 
+/*
+ * secret_key_object - a transient object of type and bits holding the
+ * key bytes as its TEE_ATTR_SECRET_VALUE. TEE_SUCCESS with *object owned
+ * by the caller; otherwise the failing call is logged in the caller's
+ * name and its result returned, with *object null.
+ */
+inline TEE_Result secret_key_object(uint32_t type, uint32_t bits, const uint8_t *key, TEE_ObjectHandle *object,
+                                    const char *func = __builtin_FUNCTION(), int line = __builtin_LINE()) {
+    *object = nullptr;
+    TEE_Attribute attr{};
+    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
+    object_guard obj;
+    TEE_Result res = TEE_AllocateTransientObject(type, bits, obj.out());
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "PopulateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    *object = obj.release();
+    return TEE_SUCCESS;
+}
+
 /* Which log texts keyed_operation uses for its two TEE calls. */
 enum class tee_call_texts : uint8_t {
     standard, // "AllocateOperation failed with 0x%08x\n", "SetOperationKey failed with 0x%08x\n"
