@@ -64,6 +64,15 @@ TEE_Result export_key_unsupported(const uint8_t *, uint32_t, uint8_t *, uint32_t
     return TEE_SUCCESS;
 }
 
+const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
+    const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
+    if (!size) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_KEY_SIZE or specified");
+        *error = KM_ERROR_INVALID_ARGUMENT;
+    }
+    return size;
+}
+
 TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,
                                    const char *func) {
     const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);

@@ -109,13 +109,9 @@ TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_da
                              int32_t *error) {
     return provider_key_slot(
         params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-            if (!size) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
-                            "No or too many KM_TAG_KEY_SIZE or specified");
-                *error = KM_ERROR_INVALID_ARGUMENT;
+            const key_param_t *size = provider_key_size(params, error, "hmac_generate_key");
+            if (!size)
                 return false;
-            }
             const uint32_t key_size = size->integer;
             if (!valid_bit_length(key_size)) {
                 KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__, "Invalid hmac key size %d",

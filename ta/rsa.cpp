@@ -79,12 +79,9 @@ bool generation_params(const keymaster_key_param_set_t *params, uint64_t *expone
         *error = KM_ERROR_INVALID_ARGUMENT;
         return false;
     }
-    const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-    if (!size) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "No or too many KM_TAG_KEY_SIZE or specified");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+    const key_param_t *size = provider_key_size(params, error, "rsa_generate_key");
+    if (!size)
         return false;
-    }
     if (!valid_key_size(size->integer)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Invalid RSA key size %d",
                     static_cast<int>(size->integer));

@@ -237,6 +237,13 @@ TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin,
                              const char *func = __builtin_FUNCTION());
 
 /*
+ * provider_key_size - the single KM_TAG_KEY_SIZE a generation needs: its
+ * parameter, or null with "No or too many KM_TAG_KEY_SIZE or specified"
+ * logged in func's name and *error -38.
+ */
+const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func);
+
+/*
  * provider_check_key_size - an import's key size: the caller's
  * KM_TAG_KEY_SIZE must equal the size the material shows ("Key size
  * mismatch (given %d, guessed %d)", *error -44); without one, the guessed
