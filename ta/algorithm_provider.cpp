@@ -64,6 +64,60 @@ TEE_Result export_key_unsupported(const uint8_t *, uint32_t, uint8_t *, uint32_t
     return TEE_SUCCESS;
 }
 
+namespace {
+constexpr uint32_t kMaxKeyAttributes = 8;
+} // namespace
+
+TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t *ids, uint32_t count,
+                                   uint32_t max_len, heap_buf *buf, int32_t *error, const char *func) {
+    uint32_t lengths[kMaxKeyAttributes] = {};
+    if (count > kMaxKeyAttributes)
+        return TEE_ERROR_GENERIC;
+    uint64_t total = 4;
+    {
+        heap_buf scratch(true);
+        if (!scratch.alloc(max_len)) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+            return TEE_SUCCESS;
+        }
+        for (uint32_t i = 0; i < count; ++i) {
+            lengths[i] = scratch.len();
+            TEE_Result res = TEE_GetObjectBufferAttribute(obj, ids[i], scratch.get(), &lengths[i]);
+            if (res != TEE_SUCCESS) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n", res);
+                return res;
+            }
+            total += 4 + uint64_t{lengths[i]};
+        }
+    }
+    if (total > UINT32_MAX || !buf->alloc(static_cast<uint32_t>(total))) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        return TEE_ERROR_OUT_OF_MEMORY;
+    }
+    byte_writer w(buf->get(), buf->len());
+    if (!w.write_u32(key_size, func))
+        return TEE_ERROR_GENERIC;
+    for (uint32_t i = 0; i < count; ++i) {
+        uint8_t *at = nullptr;
+        if (!w.write_u32(lengths[i], func) || !w.reserve(lengths[i], &at, func))
+            return TEE_ERROR_GENERIC;
+        uint32_t got = lengths[i];
+        TEE_Result res = TEE_GetObjectBufferAttribute(obj, ids[i], at, &got);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n", res);
+            return res;
+        }
+        if (got != lengths[i]) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Buffer size modified, before %dB, after %dB",
+                        static_cast<int>(lengths[i]), static_cast<int>(got));
+            *error = KM_ERROR_UNKNOWN_ERROR;
+            return TEE_SUCCESS;
+        }
+    }
+    return TEE_SUCCESS;
+}
+
 const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
     const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
     if (!size) {

@@ -74,89 +74,28 @@ TEE_Result generate_pair(const ec_curve_t &c, object_guard *obj) {
     return res;
 }
 
-// Size pass: each value's length read into a one-field scratch buffer, and
-// the key data's total size.
-TEE_Result value_lengths(TEE_ObjectHandle obj, uint32_t key_size, uint32_t lengths[kValues], uint32_t *total,
-                         int32_t *error) {
-    heap_buf scratch(true);
-    if (!scratch.alloc(ec_field_bytes(key_size))) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-        return TEE_SUCCESS;
-    }
-    *total = 4;
-    for (uint32_t i = 0; i < kValues; ++i) {
-        lengths[i] = scratch.len();
-        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], scratch.get(), &lengths[i]);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
-                        res);
-            return res;
-        }
-        // Each length is at most one field (66 bytes): no overflow.
-        *total += 4 + lengths[i];
-    }
-    return TEE_SUCCESS;
-}
-
-// Second pass: the key size, then each value straight behind its length word.
-TEE_Result write_values(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t lengths[kValues], heap_buf *buf,
-                        int32_t *error) {
-    byte_writer w(buf->get(), buf->len());
-    if (!w.write_u32(key_size, "ec_generate_key"))
-        return TEE_ERROR_GENERIC;
-    for (uint32_t i = 0; i < kValues; ++i) {
-        uint8_t *at = nullptr;
-        if (!w.write_u32(lengths[i], "ec_generate_key") || !w.reserve(lengths[i], &at, "ec_generate_key"))
-            return TEE_ERROR_GENERIC;
-        uint32_t got = lengths[i];
-        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], at, &got);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
-                        res);
-            return res;
-        }
-        if (got != lengths[i]) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Buffer size modified, before %dB, after %dB",
-                        static_cast<int>(lengths[i]), static_cast<int>(got));
-            *error = KM_ERROR_UNKNOWN_ERROR;
-            return TEE_SUCCESS;
-        }
-    }
-    return TEE_SUCCESS;
-}
-
 } // namespace
 
 TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                            int32_t *error) {
-    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
-                             [&](heap_buf *buf, TEE_Result *res) {
-                                 const key_param_t *size = provider_key_size(params, error, "ec_generate_key");
-                                 if (!size)
-                                     return false;
-                                 if (!supported_size(size->integer, "ec_generate_key")) {
-                                     *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                                     return false;
-                                 }
-                                 const uint32_t key_size = size->integer;
-                                 object_guard obj;
-                                 *res = generate_pair(*curve_of(key_size), &obj);
-                                 if (*res != TEE_SUCCESS)
-                                     return false;
-                                 uint32_t lengths[kValues] = {};
-                                 uint32_t total = 0;
-                                 *res = value_lengths(obj.get(), key_size, lengths, &total, error);
-                                 if (*res != TEE_SUCCESS || *error)
-                                     return false;
-                                 if (!buf->alloc(total)) {
-                                     KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "Out of memory");
-                                     *res = TEE_ERROR_OUT_OF_MEMORY;
-                                     return false;
-                                 }
-                                 *res = write_values(obj.get(), key_size, lengths, buf, error);
-                                 return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
-                             });
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            const key_param_t *size = provider_key_size(params, error, "ec_generate_key");
+            if (!size)
+                return false;
+            if (!supported_size(size->integer, "ec_generate_key")) {
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            const uint32_t key_size = size->integer;
+            object_guard obj;
+            *res = generate_pair(*curve_of(key_size), &obj);
+            if (*res != TEE_SUCCESS)
+                return false;
+            *res = provider_key_attributes(obj.get(), key_size, kAttributeIds, kValues, ec_field_bytes(key_size), buf,
+                                           error, "ec_generate_key");
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        });
 }
 
 TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,

@@ -110,56 +110,6 @@ TEE_Result generate_pair(uint32_t key_size, uint64_t exponent, object_guard *obj
     return res;
 }
 
-// First pass over the components: each one's length, and the key data's total size.
-TEE_Result component_lengths(TEE_ObjectHandle obj, uint32_t key_size, uint32_t lengths[kRsaComponents], uint64_t *total,
-                             int32_t *error) {
-    heap_buf scratch(true);
-    if (!scratch.alloc(key_size / 8)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-        return TEE_SUCCESS;
-    }
-    *total = 4;
-    for (uint32_t i = 0; i < kRsaComponents; ++i) {
-        lengths[i] = scratch.len();
-        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], scratch.get(), &lengths[i]);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
-                        res);
-            return res;
-        }
-        *total += 4 + uint64_t{lengths[i]};
-    }
-    return TEE_SUCCESS;
-}
-
-// Second pass: the key size, then each component straight behind its length word.
-TEE_Result write_components(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t lengths[kRsaComponents],
-                            heap_buf *buf, int32_t *error) {
-    byte_writer w(buf->get(), buf->len());
-    if (!w.write_u32(key_size, "rsa_generate_key"))
-        return TEE_ERROR_GENERIC;
-    for (uint32_t i = 0; i < kRsaComponents; ++i) {
-        uint8_t *at = nullptr;
-        if (!w.write_u32(lengths[i], "rsa_generate_key") || !w.reserve(lengths[i], &at, "rsa_generate_key"))
-            return TEE_ERROR_GENERIC;
-        uint32_t got = lengths[i];
-        TEE_Result res = TEE_GetObjectBufferAttribute(obj, kAttributeIds[i], at, &got);
-        if (res != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n",
-                        res);
-            return res;
-        }
-        if (got != lengths[i]) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Buffer size modified, before %dB, after %dB",
-                        static_cast<int>(lengths[i]), static_cast<int>(got));
-            *error = KM_ERROR_UNKNOWN_ERROR;
-            return TEE_SUCCESS;
-        }
-    }
-    return TEE_SUCCESS;
-}
-
 } // namespace
 
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
@@ -174,17 +124,8 @@ TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_dat
                                  *res = generate_pair(key_size, exponent, &obj);
                                  if (*res != TEE_SUCCESS)
                                      return false;
-                                 uint32_t lengths[kRsaComponents] = {};
-                                 uint64_t total = 0;
-                                 *res = component_lengths(obj.get(), key_size, lengths, &total, error);
-                                 if (*res != TEE_SUCCESS || *error)
-                                     return false;
-                                 if (total > UINT32_MAX || !buf->alloc(static_cast<uint32_t>(total))) {
-                                     KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Out of memory");
-                                     *res = TEE_ERROR_OUT_OF_MEMORY;
-                                     return false;
-                                 }
-                                 *res = write_components(obj.get(), key_size, lengths, buf, error);
+                                 *res = provider_key_attributes(obj.get(), key_size, kAttributeIds, kRsaComponents,
+                                                                key_size / 8, buf, error, "rsa_generate_key");
                                  return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
                              });
 }

@@ -244,6 +244,18 @@ TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin,
 const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func);
 
 /*
+ * provider_key_attributes - the key data of a generated key pair: u32
+ * key_size, then each attribute of ids, in order, as u32 length + its
+ * big-endian bytes, each at most max_len bytes, written into buf. A first
+ * pass learns the lengths through a wiped scratch buffer, so that buf is
+ * allocated exactly. TEE_SUCCESS with *error 0 when written; the TEE's
+ * result, TEE_ERROR_OUT_OF_MEMORY for buf, or *error -41 (scratch) and
+ * -1000 (a length that changed) otherwise, logged in func's name.
+ */
+TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t *ids, uint32_t count,
+                                   uint32_t max_len, heap_buf *buf, int32_t *error, const char *func);
+
+/*
  * provider_check_key_size - an import's key size: the caller's
  * KM_TAG_KEY_SIZE must equal the size the material shows ("Key size
  * mismatch (given %d, guessed %d)", *error -44); without one, the guessed
