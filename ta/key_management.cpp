@@ -223,7 +223,7 @@ TEE_Result export_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t
 
     if (key_param_set_has_tag(&key.params, KM_TAG_SOTER_IS_FROM_SOTER)) {
         KM_DEBUG("soter export_key\n");
-        return soter_enhance_export_key(&key.params, key.data.get(), key.data.len(), out, out_len, error);
+        return soter_enhance_export_key(&key.params, key.data.get(), key.data.len(), out, out_len);
     }
     KM_DEBUG("normal export_key\n");
     do {

@@ -3,6 +3,7 @@
  * or PKCS#1 blocks built here for unhashed messages.
  */
 #include "rsa.h"
+#include "soter.h"
 #include "ta_log.h"
 
 namespace {
@@ -65,15 +66,96 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
 const operation_fns_t kSignFns = operation_fns<rsa_sign_operation_t>("rsa_sign_operation_t", rsa_sign_update,
                                                                      rsa_sign_finish, rsa_signature_release);
 
+/* ---- SOTER keys: the message is collected and signed inside a document -- */
+
+constexpr uint32_t kSoterInitialCapacity = 4096;
+
+TEE_Result soter_sign_update(operation_t *header, keymaster_key_param_set_t *, const uint8_t *input,
+                             uint32_t *input_len, uint8_t *, uint32_t *output_len, int32_t *error) {
+    auto *op = operation_record<rsa_sign_operation_t>(header);
+    *output_len = 0;
+    KM_DEBUG("sign update is from soter");
+    const uint32_t n = *input_len;
+    const uint64_t needed = uint64_t{op->soter_len} + n;
+    if (needed > op->soter_capacity) {
+        const uint64_t doubled = uint64_t{op->soter_capacity} * 2;
+        const uint64_t capacity = needed > doubled ? needed : doubled;
+        uint8_t *grown = capacity > UINT32_MAX ? nullptr : static_cast<uint8_t *>(ta_malloc(capacity));
+        if (!grown) {
+            KM_ERR("no memory to expand soter buf %u", static_cast<unsigned>(capacity));
+            *input_len = 0;
+            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+            return TEE_SUCCESS;
+        }
+        TEE_MemMove(grown, op->soter_buf, op->soter_len);
+        ta_free_wiped(op->soter_buf, op->soter_capacity);
+        KM_DEBUG("expand soter buf %u -> %d", op->soter_capacity, static_cast<int>(capacity));
+        op->soter_buf = grown;
+        op->soter_capacity = static_cast<uint32_t>(capacity);
+    }
+    TEE_MemMove(op->soter_buf + op->soter_len, input, n);
+    op->soter_len += n;
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
+}
+
+TEE_Result soter_sign_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *, uint32_t,
+                             uint8_t **output, uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
+    auto *op = operation_record<rsa_sign_operation_t>(header);
+    KM_DEBUG("sign finish is from soter");
+    TEE_Result res = soter_enhance_sign_finish(op, op->soter_buf, op->soter_len, output, output_len);
+    if (res != TEE_SUCCESS) {
+        KM_ERR("soter enhance error %x", res);
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    } else {
+        *error = KM_ERROR_OK;
+    }
+    return TEE_SUCCESS;
+}
+
+const operation_fns_t kSoterSignFns = operation_fns<rsa_sign_operation_t>("rsa_sign_operation_t", soter_sign_update,
+                                                                          soter_sign_finish, rsa_signature_release);
+
+// A SOTER record: the RSA record for the begin parameters and a buffer for the raw message.
+operation_t *create_soter_sign(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
+                               int32_t *error) {
+    KM_DEBUG("sign from soter, allocate raw message buffer");
+    TEE_Result ready = soter_check_ready();
+    if (ready != TEE_SUCCESS) {
+        KM_ERR("soter resources is not ready, error 0x%x\n", ready);
+        *error = KM_ERROR_UNKNOWN_ERROR;
+        return nullptr;
+    }
+    operation_t *header =
+        rsa_signature_create(key_data, key_data_len, in_params, true, error, &kSoterSignFns, "create_rsa_sign");
+    if (!header)
+        return nullptr;
+    auto *op = operation_record<rsa_sign_operation_t>(header);
+    // The document is far longer than a block: without a digest it could
+    // only be signed cut short, so the combination is refused up front.
+    if (op->digest == KM_DIGEST_NONE) {
+        KM_ERR("soter signing needs a digest");
+        *error = KM_ERROR_INCOMPATIBLE_DIGEST;
+        operation_destroy(header, record_state::partial);
+        return nullptr;
+    }
+    op->soter_buf = static_cast<uint8_t *>(ta_malloc(kSoterInitialCapacity));
+    if (!op->soter_buf) {
+        KM_ERR("No memory for soter");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        operation_destroy(header, record_state::partial);
+        return nullptr;
+    }
+    op->soter_capacity = kSoterInitialCapacity;
+    op->soter_len = 0;
+    return header;
+}
+
 } // namespace
 
 operation_t *create_rsa_sign(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
                              keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *, int32_t *error) {
-    if (key_param_set_has_tag(key_params, KM_TAG_SOTER_IS_FROM_SOTER)) {
-        // SOTER keys sign a document built around the message; not available in this build.
-        KM_ERR("SOTER signing is not available in this build");
-        *error = KM_ERROR_UNIMPLEMENTED;
-        return nullptr;
-    }
+    if (key_param_set_has_tag(key_params, KM_TAG_SOTER_IS_FROM_SOTER))
+        return create_soter_sign(key_data, key_data_len, in_params, error);
     return rsa_signature_create(key_data, key_data_len, in_params, true, error, &kSignFns, __func__);
 }

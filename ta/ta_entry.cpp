@@ -40,7 +40,7 @@ struct command_t {
     uint32_t types;
     uint8_t zero_checks;
     bool log_type_word; // the refusal names the type word received
-    handler_fn handler; // null: not built into this TA
+    handler_fn handler;
 };
 
 int32_t *error_slot(TEE_Param params[4]) {
@@ -130,6 +130,9 @@ TEE_Result on_soter_export(void *, TEE_Param p[4]) {
 TEE_Result on_soter_device_id(void *, TEE_Param p[4]) {
     return soter_handle_get_device_id(out_buf(p), &p[2].memref.size, error_slot(p));
 }
+TEE_Result on_soter_set_fid(void *, TEE_Param p[4]) {
+    return soter_handle_setFid(in_buf(p), p[1].memref.size);
+}
 
 constexpr uint32_t types(uint32_t t0, uint32_t t1, uint32_t t2) {
     return TEE_PARAM_TYPES(t0, t1, t2, kParamsNone);
@@ -187,7 +190,7 @@ const command_t kCommands[] = {
     {KM_CMD_SOTER_EXPORT_ATTK_PUBLIC_KEY, "soter_handle_export_attk_public_key", kTypesValOutOut, CHECK_AB, false,
      on_soter_export},
     {KM_CMD_SOTER_GET_DEVICE_ID, "soter_handle_get_device_id", kTypesValOutOut, CHECK_AB, false, on_soter_device_id},
-    {KM_CMD_SOTER_SET_FID, "soter_handle_setFid", kTypesNotify, CHECK_NONE, true, nullptr},
+    {KM_CMD_SOTER_SET_FID, "soter_handle_setFid", kTypesNotify, CHECK_NONE, true, on_soter_set_fid},
 };
 
 // What a NULL memory reference is given to read and write: nothing. Its
@@ -279,6 +282,7 @@ const ta_property_t kTaProperties[] = {
 extern "C" {
 
 TEE_Result TA_CreateEntryPoint(void) {
+    soter_fid_reset();
     TEE_Result res = key_store_init();
     if (res != TEE_SUCCESS) {
         KM_ERR("Init key store failed");
@@ -360,11 +364,6 @@ TEE_Result TA_InvokeCommandEntryPoint(void *sessionContext, uint32_t commandID, 
         ((cmd->zero_checks & CHECK_B) && params[0].value.b != 0)) {
         KM_ERR("Bad argument\n");
         return TEE_ERROR_BAD_PARAMETERS;
-    }
-    if (!cmd->handler) {
-        // The command exists in the interface but this build has no handler for it.
-        KM_ERR("Command %s not implemented", cmd->name);
-        return TEE_ERROR_NOT_IMPLEMENTED;
     }
     memref_shield_t shield{};
     shield_memrefs(paramTypes, params, &shield);

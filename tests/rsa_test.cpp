@@ -435,8 +435,11 @@ TEST_F(Rsa, BeginRefusesPaddingAndDigestCombinations) {
     soter.add_bool(KM_TAG_SOTER_IS_FROM_SOTER);
     Bytes soter_blob;
     ASSERT_TRUE(import(soter, material_of(kRsa1024Pem), &soter_blob).ok());
+    // An unprovisioned device has no SOTER state to sign documents with.
+    tee_host::trace::clear();
     EXPECT_EQ(begin(KM_PURPOSE_SIGN, soter_blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), &h).error,
-              KM_ERROR_UNIMPLEMENTED);
+              KM_ERROR_UNKNOWN_ERROR);
+    EXPECT_TRUE(logged_message("soter resources is not ready, error 0xffff0008")) << dump_log();
 }
 
 // Destroying a complete record names each required member it finds

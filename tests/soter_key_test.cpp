@@ -7,8 +7,6 @@
 #include <fstream>
 #include <string>
 
-#include <openssl/bn.h>
-#include <openssl/core_names.h>
 #include <openssl/evp.h>
 
 #include "keymaster_defs.h"
@@ -30,29 +28,11 @@ struct TestKey {
     Bytes spki; // DER SubjectPublicKeyInfo
 };
 
-Bytes bn_param(const EVP_PKEY *key, const char *name) {
-    BIGNUM *bn = nullptr;
-    EXPECT_EQ(EVP_PKEY_get_bn_param(key, name, &bn), 1) << name;
-    Bytes out(static_cast<size_t>(BN_num_bytes(bn)), 0);
-    BN_bn2bin(bn, out.data());
-    BN_free(bn);
-    return out;
-}
-
 // The fixed RSA-2048 test key as factory data, with its public key.
 const TestKey &test_key() {
     static const TestKey key = [] {
         TestKey k;
-        Pkey decoded = decode_rsa(kRsa2048Pem);
-        const EVP_PKEY *pkey = decoded.get();
-        k.data.n = bn_param(pkey, OSSL_PKEY_PARAM_RSA_N);
-        k.data.e = bn_param(pkey, OSSL_PKEY_PARAM_RSA_E);
-        k.data.d = bn_param(pkey, OSSL_PKEY_PARAM_RSA_D);
-        k.data.p = bn_param(pkey, OSSL_PKEY_PARAM_RSA_FACTOR1);
-        k.data.q = bn_param(pkey, OSSL_PKEY_PARAM_RSA_FACTOR2);
-        k.data.dp = bn_param(pkey, OSSL_PKEY_PARAM_RSA_EXPONENT1);
-        k.data.dq = bn_param(pkey, OSSL_PKEY_PARAM_RSA_EXPONENT2);
-        k.data.qinv = bn_param(pkey, OSSL_PKEY_PARAM_RSA_COEFFICIENT1);
+        k.data = factory_key(kRsa2048Pem);
         k.data.sensor_name = "sensor";
         k.data.sensor_version = "2.1";
         k.data.fp_ta_uuid = trusted_client_uuids[0];

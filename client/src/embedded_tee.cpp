@@ -36,6 +36,10 @@ TEE_Result EmbeddedTee::invoke(uint32_t cmd, uint32_t types, TEE_Param params[4]
     return tee_->invoke(session_, cmd, types, params);
 }
 
+TEE_Result EmbeddedTee::notify_fid(uint32_t fid) {
+    return tee_host::fingerprint::notify(keymaster_ta_uuid, fid);
+}
+
 void EmbeddedTee::close() {
     if (session_ == 0)
         return;

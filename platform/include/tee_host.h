@@ -74,6 +74,8 @@ class Tee {
     // close_session - unknown ids are ignored; the last close destroys the instance.
     void close_session(uint32_t session);
 
+    // has_ta - whether a TA of that UUID is installed.
+    bool has_ta(const TEE_UUID &ta) const;
     // instance_alive - whether the TA of that UUID currently has an instance.
     bool instance_alive(const TEE_UUID &ta) const;
     size_t open_sessions() const;
@@ -246,11 +248,45 @@ void reset();
 // served - the requests of this kind answered since the last reset.
 size_t served(Request request);
 
+// fingerprint_ta_uuid - the fingerprint TA's UUID that the store of
+// state_dir names; false when there is no readable store or it names none.
+bool fingerprint_ta_uuid(const std::filesystem::path &state_dir, TEE_UUID *uuid);
+
 // The answers built from factory data, as the store gives them.
 std::vector<uint8_t> key_answer(const FactoryData &data);
 std::vector<uint8_t> soter_property_answer(const FactoryData &data);
 
 } // namespace provisioning
+
+// The fingerprint TA: the device's fingerprint service. When a finger
+// matches, it tells the Keymaster TA which fingerprint it was (command
+// 0xFF04) over a TA-to-TA session opened through the GP client API, with a
+// timestamp read from the TEE system time. It is registered under the UUID
+// that the factory store names; an unprovisioned device has none.
+namespace fingerprint {
+
+// The command of the Keymaster TA that takes the notification.
+constexpr uint32_t kNotifyCommand = 0xFF04;
+
+// notification - the 16 bytes the TA sends: version, fid, timestamp in
+// milliseconds, little-endian.
+std::vector<uint8_t> notification(uint32_t version, uint32_t fid, uint64_t timestamp_ms);
+
+// notify - the fingerprint TA sends the notification for fid (version 0,
+// stamped now) to the TA `target`. TEE_ERROR_ITEM_NOT_FOUND when the device
+// is not provisioned (there is no fingerprint TA); otherwise the result of
+// opening the session or of the command.
+TEE_Result notify(const TEE_UUID &target, uint32_t fid);
+
+// send - the fingerprint TA sends exactly these bytes instead.
+TEE_Result send(const TEE_UUID &target, const std::vector<uint8_t> &bytes);
+
+// send_as - the bytes sent from a session whose client identity is
+// `client` rather than the fingerprint TA's own: what another TA, or a
+// caller with another login, would try.
+TEE_Result send_as(const TEE_UUID &target, const TEE_Identity &client, const std::vector<uint8_t> &bytes);
+
+} // namespace fingerprint
 
 namespace detail {
 // make_provisioning_ta - the provisioning TA on a state directory; the Tee installs it at start.

@@ -34,19 +34,22 @@ struct Session {
 };
 
 thread_local const TEE_Identity *t_client = nullptr;
-thread_local const ta_header_t *t_ta = nullptr;
+thread_local const ta_header_t *t_ta = nullptr; // null inside a host-side stand-in
+thread_local const TEE_UUID *t_self = nullptr;  // the TA running, of either kind
 
 // Marks the current thread as running inside a TA for a client; nests for
 // TA-to-TA calls.
 class CallScope {
   public:
-    CallScope(const Installed &ta, const TEE_Identity &client) : client_(t_client), ta_(t_ta) {
+    CallScope(const Installed &ta, const TEE_Identity &client) : client_(t_client), ta_(t_ta), self_(t_self) {
         t_client = &client;
         t_ta = ta.header;
+        t_self = &ta.uuid;
     }
     ~CallScope() {
         t_client = client_;
         t_ta = ta_;
+        t_self = self_;
     }
     CallScope(const CallScope &) = delete;
     CallScope &operator=(const CallScope &) = delete;
@@ -54,6 +57,7 @@ class CallScope {
   private:
     const TEE_Identity *client_;
     const ta_header_t *ta_;
+    const TEE_UUID *self_;
 };
 
 bool same_uuid(const TEE_UUID &a, const TEE_UUID &b) {
@@ -237,7 +241,7 @@ TEE_Result Tee::open_session(const TEE_UUID &uuid, const TEE_Identity &client, u
     }
     if (!ta)
         return TEE_ERROR_ITEM_NOT_FOUND;
-    if (ta->header && t_ta == ta->header)
+    if (t_self && same_uuid(*t_self, uuid))
         return TEE_ERROR_ACCESS_DENIED; // a TA cannot open a session to itself
 
     std::lock_guard<std::mutex> ta_lock(ta->mu);
@@ -247,6 +251,7 @@ TEE_Result Tee::open_session(const TEE_UUID &uuid, const TEE_Identity &client, u
     void *ctx = nullptr;
     TEE_Result res = TEE_SUCCESS;
     if (ta->native) {
+        CallScope scope(*ta, client);
         res = ta->native->open_session(client, &ctx);
     } else {
         CallScope scope(*ta, client);
@@ -295,9 +300,9 @@ TEE_Result Tee::invoke(uint32_t session, uint32_t command, uint32_t param_types,
         if (!impl_->sessions.count(session))
             return TEE_ERROR_BAD_STATE;
     }
+    CallScope scope(*s.ta, s.client);
     if (s.ta->native)
         return s.ta->native->invoke(s.ctx, command, param_types, params);
-    CallScope scope(*s.ta, s.client);
     return s.ta->header->invoke_command_entry(s.ctx, command, param_types, params);
 }
 
@@ -317,6 +322,7 @@ void Tee::close_session(uint32_t session) {
             return;
     }
     if (s.ta->native) {
+        CallScope scope(*s.ta, s.client);
         s.ta->native->close_session(s.ctx);
         return;
     }
@@ -326,6 +332,11 @@ void Tee::close_session(uint32_t session) {
     }
     if (--s.ta->sessions == 0)
         Impl::end_instance(*s.ta, s.client);
+}
+
+bool Tee::has_ta(const TEE_UUID &uuid) const {
+    std::lock_guard<std::mutex> lock(impl_->mu);
+    return impl_->find_ta(uuid) != nullptr;
 }
 
 bool Tee::instance_alive(const TEE_UUID &uuid) const {
@@ -362,11 +373,11 @@ TEE_Result TEE_OpenTASession(const TEE_UUID *destination, uint32_t, uint32_t par
                              TEE_TASessionHandle *session, uint32_t *returnOrigin) {
     if (!destination || !session)
         detail::panic("TEE_OpenTASession with a null destination or session");
-    const ta_header_t *self = t_ta;
+    const TEE_UUID *self = t_self;
     if (!self || !g_current)
         detail::panic("TEE_OpenTASession outside a TA");
     uint32_t id = 0;
-    TEE_Result res = g_current->open_session(*destination, ta_identity(self->uuid), paramTypes, params, &id);
+    TEE_Result res = g_current->open_session(*destination, ta_identity(*self), paramTypes, params, &id);
     if (returnOrigin)
         *returnOrigin =
             res == TEE_ERROR_ITEM_NOT_FOUND || res == TEE_ERROR_ACCESS_DENIED ? TEE_ORIGIN_TEE : TEE_ORIGIN_TRUSTED_APP;

@@ -298,6 +298,29 @@ class ProvisioningTa final : public NativeTa {
 
 } // namespace
 
+bool fingerprint_ta_uuid(const fs::path &state_dir, TEE_UUID *uuid) {
+    Stored s;
+    TEE_Result res = load(state_dir, &s);
+    wipe(s.key);
+    if (res != TEE_SUCCESS)
+        return false;
+    // The property answer is a run of (u16 type, u16 length, value).
+    const std::vector<uint8_t> &p = s.properties;
+    for (size_t pos = 0; p.size() - pos >= 4;) {
+        const size_t type = p[pos] | size_t{p[pos + 1]} << 8;
+        const size_t len = p[pos + 2] | size_t{p[pos + 3]} << 8;
+        pos += 4;
+        if (p.size() - pos < len)
+            return false;
+        if (type == 0x1837 && len == sizeof *uuid) {
+            std::memcpy(uuid, p.data() + pos, sizeof *uuid);
+            return true;
+        }
+        pos += len;
+    }
+    return false;
+}
+
 std::vector<uint8_t> key_answer(const FactoryData &data) {
     std::vector<uint8_t> out;
     put_tlv(out, 17, data.n);

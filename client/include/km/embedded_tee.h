@@ -33,6 +33,7 @@ class EmbeddedTee final : public Transport {
     TEE_Result open() override;
     TEE_Result invoke(uint32_t cmd, uint32_t types, TEE_Param params[4]) override;
     void close() override;
+    TEE_Result notify_fid(uint32_t fid) override;
 
     // tee - the emulated TEE itself, for callers that drive the platform.
     tee_host::Tee &tee() { return *tee_; }

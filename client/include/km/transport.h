@@ -8,6 +8,7 @@
 
 #include <cstdint>
 
+#include "tee_api_defines.h"
 #include "tee_api_types.h"
 
 namespace km {
@@ -28,6 +29,13 @@ class Transport {
 
     // close - closes the session; closing a closed transport does nothing.
     virtual void close() = 0;
+
+    // notify_fid - has the fingerprint TA beside the Keymaster TA report
+    // that fingerprint fid matched (it sends its notification now).
+    // TEE_SUCCESS when the Keymaster TA took it; otherwise the refusal
+    // (TEE_ERROR_ITEM_NOT_FOUND: the device has no fingerprint TA;
+    // TEE_ERROR_NOT_SUPPORTED: this transport reaches none).
+    virtual TEE_Result notify_fid(uint32_t) { return TEE_ERROR_NOT_SUPPORTED; }
 };
 
 } // namespace km
