@@ -341,7 +341,7 @@ struct json_text_guard {
 // The key that signs an export document, as the exported key's tags choose it.
 TEE_Result export_signing_key(const keymaster_key_param_set_t *key_params, TEE_ObjectHandle *key, uint32_t *key_size) {
     if (key_param_set_has_tag(key_params, KM_TAG_SOTER_IS_AUTO_SIGNED_WITH_ATTK_WHEN_GET_PUBLIC_KEY)) {
-        KM_ERR("soter use attkey sign\n");
+        KM_INFO("soter use attkey sign\n");
         TEE_Result res = soter_check_ready();
         if (res != TEE_SUCCESS) {
             KM_ERR("soter is not ready\n");
@@ -351,15 +351,15 @@ TEE_Result export_signing_key(const keymaster_key_param_set_t *key_params, TEE_O
         return TEE_SUCCESS;
     }
     if (key_param_set_has_tag(key_params, KM_TAG_SOTER_IS_AUTO_SIGNED_WITH_COMMON_KEY_WHEN_GET_PUBLIC_KEY)) {
-        KM_ERR("soter use normal key sign\n");
+        KM_INFO("soter use normal key sign\n");
         const key_param_t *blob =
             key_param_set_find_unique(key_params, KM_TAG_SOTER_AUTO_SIGNED_COMMON_KEY_WHEN_GET_PUBLIC_KEY_BLOB);
         if (blob) {
-            KM_ERR("use key blob argument to retrieve sign key\n");
+            KM_INFO("use key blob argument to retrieve sign key\n");
         } else {
             blob = key_param_set_find_unique(key_params, KM_TAG_SOTER_AUTO_SIGNED_COMMON_KEY_WHEN_GET_PUBLIC_KEY);
             if (blob)
-                KM_ERR("use key name argument as key blob to retrieve sign key\n");
+                KM_INFO("use key name argument as key blob to retrieve sign key\n");
         }
         if (!blob) {
             KM_ERR("no sign key with key blob\n");
@@ -396,7 +396,7 @@ TEE_Result soter_enhance_export_key(const keymaster_key_param_set_t *key_params,
         return TEE_ERROR_OUT_OF_MEMORY;
     }
     if (key_param_set_has_tag(key_params, KM_TAG_SOTER_AUTO_ADD_COUNTER_WHEN_GET_PUBLIC_KEY)) {
-        KM_ERR("This key need increase the counter");
+        KM_INFO("This key need increase the counter");
         uint64_t counter = 0;
         TEE_Result res = increase_and_get_counter(&counter);
         if (res != TEE_SUCCESS) {
@@ -411,7 +411,7 @@ TEE_Result soter_enhance_export_key(const keymaster_key_param_set_t *key_params,
     }
     const key_param_t *uid = key_param_set_find_unique(key_params, KM_TAG_SOTER_UID);
     if (uid) {
-        KM_ERR("soter key has uid\n");
+        KM_INFO("soter key has uid\n");
         int rc = json_doc_set_number(doc.doc, "uid", static_cast<double>(uid->integer));
         if (rc != 0) {
             KM_ERR("set number error %x\n", rc);
@@ -485,7 +485,7 @@ bool set_sign_members(json_doc *doc, uint64_t uid) {
             return false;
         }
     } else {
-        KM_ERR("get finger id error %x, continue without fid\n", res);
+        KM_INFO("get finger id error %x, continue without fid\n", res);
     }
     uint64_t counter = 0;
     res = increase_and_get_counter(&counter);
@@ -600,7 +600,7 @@ TEE_Result soter_enhance_sign_finish(rsa_sign_operation_t *op, const uint8_t *me
     const key_param_t *uid_param = key_param_set_find_unique(&op->header.key_params, KM_TAG_SOTER_UID);
     if (uid_param) {
         uid = uid_param->integer;
-        KM_ERR("soter key has uid\n");
+        KM_INFO("soter key has uid\n");
     }
     json_text_guard text{produce_soter_sign_json(uid, message, message_len)};
     if (!text.text) {

@@ -15,7 +15,8 @@ lib=$(cd "$p" && ls -d lib*/cmake/KeymasterClient | head -1 | cut -d/ -f1)
 for f in bin/kmctl share/man/man1/kmctl.1 "$lib/libkm_client.a" "$lib/libkeymaster_ta.a" "$lib/libtee_platform.a" \
   include/keymaster-client/km/client.h include/keymaster-client/km/embedded_tee.h \
   include/keymaster-client/tee_api_types.h "$lib/cmake/KeymasterClient/KeymasterClientConfig.cmake" \
-  "$lib/cmake/KeymasterClient/KeymasterClientConfigVersion.cmake" "$lib/pkgconfig/keymaster-client.pc"; do
+  "$lib/cmake/KeymasterClient/KeymasterClientConfigVersion.cmake" "$lib/pkgconfig/keymaster-client.pc" \
+  "$lib/libsoter_verifier.a" include/keymaster-client/soter/verifier.h "$lib/pkgconfig/soter-verifier.pc"; do
   [ -f "$p/$f" ] || fail "not installed: $f"
 done
 
@@ -36,4 +37,16 @@ cmake --build "$work/consumer" >/dev/null
 out=$("$work/consumer/consumer" "$work/state")
 grep -qx rsa <<<"$out" || fail "the consumer lists no rsa: $out"
 grep -q '^generated a blob of [1-9][0-9]* bytes$' <<<"$out" || fail "the consumer generated no key: $out"
+# The installed verifier checks a statement the installed kmctl made.
+k=("$p/bin/kmctl" --state "$work/state" --log-level none)
+"${k[@]}" soter provision >/dev/null 2>&1 || fail "soter provision"
+"${k[@]}" soter attk export --out "$work/attk.pem" || fail "soter attk export"
+"${k[@]}" generate --algorithm rsa --size 1024 --soter --soter-sign-with attk --out "$work/soter.blob" ||
+  fail "generate a SOTER key"
+"${k[@]}" export --key "$work/soter.blob" --out "$work/statement" || fail "export the SOTER key"
+[ "$("$work/consumer/server_check" "$work/attk.pem" "$work/statement")" = valid ] ||
+  fail "the installed verifier refuses a good statement"
+printf x >>"$work/statement"
+[ "$("$work/consumer/server_check" "$work/attk.pem" "$work/statement")" = signature ] ||
+  fail "the installed verifier takes a statement with a byte appended"
 echo "install ok"

@@ -5,14 +5,16 @@
  */
 #include <sys/wait.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
+#include <openssl/evp.h>
+
+#include "cli_files.h"
 #include "rsa_keys.h"
 #include "soter_keys.h"
 
@@ -20,19 +22,6 @@ namespace {
 
 namespace fs = std::filesystem;
 using Bytes = std::vector<uint8_t>;
-
-struct CliRun {
-    int status = -1;
-    std::string out;
-    std::string err;
-};
-
-std::string slurp(const fs::path &p) {
-    std::ifstream in(p, std::ios::binary);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-}
 
 Bytes slurp_bytes(const fs::path &p) {
     std::string s = slurp(p);
@@ -48,8 +37,7 @@ std::string last_line(std::string s) {
 }
 
 void spit(const fs::path &p, const std::string &data) {
-    std::ofstream out(p, std::ios::binary);
-    out << data;
+    ::spit(p, Bytes(data.begin(), data.end()));
 }
 
 class KmctlSoter : public ::testing::Test {
@@ -166,6 +154,152 @@ TEST_F(KmctlSoter, ProvisionRefusesBadInput) {
     r = kmctl("soter attk verify");
     EXPECT_EQ(r.status, 1);
     EXPECT_EQ(last_line(r.err), "not provisioned") << r.err;
+}
+
+// The signature check a server makes, done with OpenSSL alone: SHA-256
+// with PKCS#1 v1.5 under the PEM public key, over exactly these bytes.
+bool openssl_verifies(const std::string &pub_pem, const Bytes &data, const Bytes &sig) {
+    Pkey key = decode_rsa(pub_pem);
+    if (!key)
+        return false;
+    EVP_MD_CTX *md = EVP_MD_CTX_new();
+    bool ok = EVP_DigestVerifyInit(md, nullptr, EVP_sha256(), nullptr, key.get()) == 1 &&
+              EVP_DigestVerify(md, sig.data(), sig.size(), data.data(), data.size()) == 1;
+    EVP_MD_CTX_free(md);
+    return ok;
+}
+
+// The counter member of a document; -1 when it has none.
+long long counter_of(const std::string &json) {
+    const std::string key = "\"counter\":";
+    size_t at = json.find(key);
+    return at == std::string::npos ? -1 : std::stoll(json.substr(at + key.size()));
+}
+
+// The whole chain a relying server sees: the ATTK signs the application
+// key's export, the application key the authentication key's, and the
+// authentication key signs the challenge with the fingerprint that matched.
+TEST_F(KmctlSoter, StatementChainVerifiesLinkByLink) {
+    spit(path("attk.pem"), kRsa2048Pem);
+    ASSERT_EQ(kmctl("soter provision --attk " + path("attk.pem") + " --cpu-id cpu-9").status, 0);
+    ASSERT_EQ(kmctl("soter attk export --out " + path("attk.pub")).status, 0);
+    CliRun r = kmctl("generate --algorithm rsa --soter --soter-sign-with attk --soter-counter --out " + path("app"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    r = kmctl("generate --algorithm rsa --soter --soter-uid 4242 --soter-sign-with-key " + path("app") + " --out " +
+              path("auth"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    r = kmctl("characteristics --key " + path("auth"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    for (const char *tag : {"KM_TAG_SOTER_IS_FROM_SOTER", "KM_TAG_SOTER_UID",
+                            "KM_TAG_SOTER_IS_AUTO_SIGNED_WITH_COMMON_KEY_WHEN_GET_PUBLIC_KEY",
+                            "KM_TAG_SOTER_AUTO_SIGNED_COMMON_KEY_WHEN_GET_PUBLIC_KEY_BLOB"})
+        EXPECT_NE(r.out.find(tag), std::string::npos) << tag << "\n" << r.out;
+
+    // The application key's export, whole and split, under the ATTK.
+    ASSERT_EQ(kmctl("export --key " + path("app") + " --out " + path("app.exp")).status, 0);
+    r = kmctl("soter verify export --in " + path("app.exp") + " --key " + path("attk.pub") + " --pub-key-out " +
+              path("app.pub"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    r = kmctl("export --key " + path("app") + " --json-out " + path("app.json") + " --signature-out " +
+              path("app.sig"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    const std::string app_json = slurp(path("app.json"));
+    EXPECT_EQ(app_json.rfind("{\"counter\":2,\"pub_key\":\"-----BEGIN PUBLIC KEY-----\\n", 0), 0u) << app_json;
+    EXPECT_TRUE(openssl_verifies(kRsa2048Pem, slurp_bytes(path("app.json")), slurp_bytes(path("app.sig"))));
+    const std::string app_pub = slurp(path("app.pub"));
+
+    // The authentication key's export, under the application key only.
+    ASSERT_EQ(kmctl("export --key " + path("auth") + " --out " + path("auth.exp")).status, 0);
+    r = kmctl("soter verify export --in " + path("auth.exp") + " --key " + path("attk.pub"));
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("signature"), std::string::npos) << r.err;
+    r = kmctl("soter verify export --in " + path("auth.exp") + " --key " + path("app.pub") + " --pub-key-out " +
+              path("auth.pub"));
+    ASSERT_EQ(r.status, 0) << r.err;
+
+    // A challenge signed right after the fingerprint TA reported finger 6.
+    spit(path("challenge"), "nonce-from-the-server-0001");
+    r = kmctl("sign --key " + path("auth") + " --in " + path("challenge") + " --fid 6 --out " + path("sig.out") +
+              " --json-out " + path("sig.json") + " --signature-out " + path("sig.sig"));
+    ASSERT_EQ(r.status, 0) << r.err;
+    const Bytes signed_doc = slurp_bytes(path("sig.json"));
+    ASSERT_FALSE(signed_doc.empty());
+    EXPECT_EQ(signed_doc.back(), 0) << "the signing document is signed with its NUL";
+    const std::string doc(signed_doc.begin(), signed_doc.end() - 1);
+    EXPECT_EQ(doc, "{\"raw\":\"nonce-from-the-server-0001\",\"fid\":6,\"counter\":3,\"uid\":4242,"
+                   "\"tee_n\":\"Host TEE Emulation\",\"tee_v\":\"1.0.0\",\"fp_n\":\"host-fingerprint-sensor\","
+                   "\"fp_v\":\"1.0\",\"cpu_id\":\"cpu-9\"}");
+    EXPECT_TRUE(openssl_verifies(slurp(path("auth.pub")), signed_doc, slurp_bytes(path("sig.sig"))));
+    EXPECT_FALSE(openssl_verifies(app_pub, signed_doc, slurp_bytes(path("sig.sig"))));
+
+    const std::string sign_check = "soter verify sign --in " + path("sig.out") + " --key " + path("auth.pub") +
+                                   " --challenge-file " + path("challenge");
+    r = kmctl(sign_check + " --last-counter 2 --uid 4242 --cpu-id cpu-9 --fid 6");
+    EXPECT_EQ(r.status, 0) << r.err;
+    r = kmctl(sign_check + " --last-counter 3");
+    EXPECT_EQ(r.status, 1) << "a replayed counter";
+    EXPECT_NE(r.err.find("counter"), std::string::npos) << r.err;
+    r = kmctl(sign_check + " --fid 7");
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("fid"), std::string::npos) << r.err;
+}
+
+TEST_F(KmctlSoter, CounterNeverRepeatsAcrossProcesses) {
+    ASSERT_EQ(kmctl("soter provision").status, 0);
+    ASSERT_EQ(kmctl("generate --algorithm rsa --size 1024 --soter --soter-sign-with attk --soter-counter --out " +
+                    path("key"))
+                  .status,
+              0);
+    // Four processes at once on one state directory, then one more after they all ended.
+    std::string cmd;
+    for (int i = 0; i < 4; ++i)
+        cmd += std::string("'") + KMCTL_PATH + "' --state '" + state_.string() + "' --log-level none export --key " +
+               path("key") + " --json-out " + path("j") + std::to_string(i) + " --signature-out " + path("s") +
+               std::to_string(i) + " & ";
+    cmd += "wait";
+    ASSERT_EQ(std::system(cmd.c_str()), 0);
+    ASSERT_EQ(
+        kmctl("export --key " + path("key") + " --json-out " + path("j4") + " --signature-out " + path("s4")).status,
+        0);
+    std::vector<long long> seen;
+    for (int i = 0; i < 4; ++i)
+        seen.push_back(counter_of(slurp(path("j") + std::to_string(i))));
+    std::sort(seen.begin(), seen.end());
+    EXPECT_EQ(seen, (std::vector<long long>{1, 2, 3, 4}));
+    EXPECT_EQ(counter_of(slurp(path("j4"))), 5);
+}
+
+TEST_F(KmctlSoter, StatementOptionsAreCheckedBeforeAnyStatementIsMade) {
+    ASSERT_EQ(kmctl("soter provision").status, 0);
+    EXPECT_EQ(kmctl("generate --algorithm rsa --soter-counter --out " + path("k")).status, 2) << "needs --soter";
+    EXPECT_EQ(kmctl("generate --algorithm ec --soter --out " + path("k")).status, 2);
+    EXPECT_EQ(
+        kmctl("generate --algorithm rsa --soter --soter-sign-with attk --soter-sign-with-key x --out " + path("k"))
+            .status,
+        2);
+    EXPECT_EQ(kmctl("generate --algorithm rsa --soter --soter-sign-with ek --out " + path("k")).status, 2);
+    EXPECT_FALSE(fs::exists(path("k")));
+
+    ASSERT_EQ(kmctl("generate --algorithm rsa --size 1024 --out " + path("plain")).status, 0);
+    spit(path("m"), "m");
+    CliRun r = kmctl("export --key " + path("plain") + " --json-out " + path("j") + " --signature-out " + path("s"));
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("not a SOTER key"), std::string::npos) << r.err;
+    r = kmctl("sign --key " + path("plain") + " --in " + path("m") + " --fid 1 --out " + path("s"));
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("not a SOTER key"), std::string::npos) << r.err;
+    EXPECT_EQ(kmctl("export --key " + path("plain") + " --json-out " + path("j")).status, 2) << "both or neither";
+    EXPECT_FALSE(fs::exists(path("j")));
+    EXPECT_FALSE(fs::exists(path("s")));
+
+    // A SOTER key without a signer for its export: signing works, the export is refused.
+    ASSERT_EQ(kmctl("generate --algorithm rsa --size 1024 --soter --soter-counter --out " + path("nosigner")).status,
+              0);
+    r = kmctl("export --key " + path("nosigner") + " --out " + path("e"));
+    EXPECT_EQ(r.status, 3) << r.err;
+    EXPECT_FALSE(fs::exists(path("e")));
+    r = kmctl("sign --key " + path("nosigner") + " --in " + path("m") + " --out " + path("sig"));
+    EXPECT_EQ(r.status, 0) << r.err;
 }
 
 } // namespace

@@ -104,6 +104,37 @@ const std::vector<Step> &steps() {
         {nullptr, {"soter", "attk", "export", "--out", "attk.pub.pem"}, kExitOk},
         {nullptr, {"soter", "device-id"}, kExitOk},
 
+        {"SOTER: an application key attested by the ATTK, an authentication key by the application key",
+         {"generate", "--algorithm", "rsa", "--soter", "--soter-sign-with", "attk", "--soter-counter", "--out",
+          "app.blob"},
+         kExitOk},
+        {nullptr, {"export", "--key", "app.blob", "--out", "app.statement"}, kExitOk},
+        {nullptr,
+         {"soter", "verify", "export", "--in", "app.statement", "--key", "attk.pub.pem", "--pub-key-out",
+          "app.pub.pem"},
+         kExitOk},
+        {nullptr,
+         {"generate", "--algorithm", "rsa", "--soter", "--soter-uid", "1000", "--soter-sign-with-key", "app.blob",
+          "--out", "auth.blob"},
+         kExitOk},
+        {nullptr, {"export", "--key", "auth.blob", "--out", "auth.statement"}, kExitOk},
+        {nullptr,
+         {"soter", "verify", "export", "--in", "auth.statement", "--key", "app.pub.pem", "--pub-key-out",
+          "auth.pub.pem"},
+         kExitOk},
+        {nullptr, {"soter", "verify", "export", "--in", "auth.statement", "--key", "attk.pub.pem"}, kExitRefused},
+        {"SOTER: finger 7 matches, the server's challenge is signed, and the server checks every member",
+         {"sign", "--key", "auth.blob", "--in", "challenge.txt", "--fid", "7", "--out", "challenge.statement"},
+         kExitOk},
+        {nullptr,
+         {"soter", "verify", "sign", "--in", "challenge.statement", "--key", "auth.pub.pem", "--challenge-file",
+          "challenge.txt", "--last-counter", "1", "--uid", "1000", "--fid", "7"},
+         kExitOk},
+        {nullptr,
+         {"soter", "verify", "sign", "--in", "challenge.statement", "--key", "auth.pub.pem", "--challenge-file",
+          "message.txt"},
+         kExitRefused},
+
         {"Forgetting a key: the blob file goes, and nothing else was ever stored",
          {"delete", "--key", "hmac.blob"},
          kExitOk},
@@ -162,6 +193,7 @@ void walk(const std::string &keep) {
     const fs::path state = dir / "state";
     std::ofstream(dir / "message.txt") << "A message the TA signs, MACs and encrypts.\n";
     std::ofstream(dir / "tampered.txt") << "A message the TA signs, MACs and encrypts!\n";
+    std::ofstream(dir / "challenge.txt") << "server-challenge-5f3a91c2";
     std::cout << "Work directory " << dir.string() << " (state in " << state.string() << ")\n";
 
     int unexpected = 0;

@@ -1,6 +1,7 @@
 /*
  * export.cpp - `kmctl export`: the public key of an RSA or EC key as an
- * X.509 SubjectPublicKeyInfo (command 20), DER or PEM.
+ * X.509 SubjectPublicKeyInfo (command 20), DER or PEM; for a SOTER key the
+ * signed statement the TA makes of it.
  */
 #include <memory>
 
@@ -8,6 +9,7 @@
 #include "keymaster_defs.h"
 #include "key_options.h"
 #include "km/key_material.h"
+#include "soter_statement.h"
 
 namespace kmctl {
 namespace {
@@ -16,6 +18,7 @@ struct ExportOptions {
     KeyOptions key;
     std::string format = "pem";
     std::string out;
+    StatementOutputs statement;
 };
 
 } // namespace
@@ -27,13 +30,19 @@ Command add_export(CLI::App &kmctl, const GlobalOptions &options) {
     app->add_option("--format", o->format, "pem (default) or der")
         ->transform(CLI::IsMember({"pem", "der"}, CLI::ignore_case))
         ->type_name("FORMAT");
-    add_out_option(*app, o->out, "The public key", true);
-    return {app, [o, &options] {
+    CLI::Option *out = add_out_option(*app, o->out, "The public key (SOTER key: the signed statement)", true);
+    add_statement_options(*app, o->statement, out);
+    return {app, [o, out, &options] {
                 km::KeyReference key = key_reference(o->key);
                 Session session(options);
-                // The TA's refusal (a symmetric key, say) comes first and as it is.
-                km::Bytes exported = take(session.client().export_key(key));
                 km::ParamSet chars = take(session.client().characteristics(key));
+                const bool soter = is_soter_key(chars);
+                check_statement_request(o->statement, out, soter, "export");
+                km::Bytes exported = take(session.client().export_key(key));
+                if (soter) {
+                    write_statement(o->out, out, o->statement, exported, false);
+                    return;
+                }
                 const km::Param *algorithm = chars.find(KM_TAG_ALGORITHM);
                 std::string why;
                 std::optional<km::Bytes> der =

@@ -67,7 +67,51 @@ void add_new_key_options(CLI::App &app, NewKeyOptions &desc) {
     app.add_option("--tag", desc.tags, "Any key parameter, NAME[=VALUE]; repeatable")
         ->allow_extra_args(false)
         ->type_name("NAME[=VALUE]");
+    app.add_flag("--soter", desc.soter, "A SOTER key (RSA): export and signing give signed statements");
+    app.add_flag("--soter-counter", desc.soter_counter, "SOTER: each export takes a new counter value");
+    app.add_option("--soter-uid", desc.soter_uid, "SOTER: the user id the statements carry")->type_name("N");
+    app.add_option("--soter-sign-with", desc.soter_sign_with, "SOTER: the export is signed by the device's ATTK")
+        ->check(CLI::IsMember({"attk"}))
+        ->type_name("attk");
+    app.add_option("--soter-sign-with-key", desc.soter_sign_with_key,
+                   "SOTER: the export is signed by this RSA key (a key blob of this TA)")
+        ->type_name("BLOB");
 }
+
+namespace {
+
+// The SOTER tags of a new key, from its options.
+void add_soter_tags(km::ParamSet &set, const NewKeyOptions &desc, uint32_t algorithm) {
+    const bool described = desc.soter_counter || !desc.soter_uid.empty() || !desc.soter_sign_with.empty() ||
+                           !desc.soter_sign_with_key.empty();
+    if (!desc.soter) {
+        if (described)
+            usage_error("--soter-counter, --soter-uid and --soter-sign-with* describe a SOTER key: add --soter");
+        return;
+    }
+    if (algorithm != KM_ALGORITHM_RSA)
+        usage_error("--soter: SOTER keys are RSA keys");
+    if (!desc.soter_sign_with.empty() && !desc.soter_sign_with_key.empty())
+        usage_error("--soter-sign-with and --soter-sign-with-key: the export has one signer");
+    set.add_bool(KM_TAG_SOTER_IS_FROM_SOTER);
+    // Servers check statements with PKCS#1 v1.5 over SHA-256 first: the
+    // usable default, so that sign needs no --padding.
+    if (!set.find(KM_TAG_PADDING))
+        set.add(KM_TAG_PADDING, KM_PAD_RSA_PKCS1_1_5_SIGN);
+    if (desc.soter_counter)
+        set.add_bool(KM_TAG_SOTER_AUTO_ADD_COUNTER_WHEN_GET_PUBLIC_KEY);
+    if (!desc.soter_uid.empty())
+        add_tag_value(set, "--soter-uid", "KM_TAG_SOTER_UID", desc.soter_uid);
+    if (!desc.soter_sign_with.empty())
+        set.add_bool(KM_TAG_SOTER_IS_AUTO_SIGNED_WITH_ATTK_WHEN_GET_PUBLIC_KEY);
+    if (!desc.soter_sign_with_key.empty()) {
+        set.add_bool(KM_TAG_SOTER_IS_AUTO_SIGNED_WITH_COMMON_KEY_WHEN_GET_PUBLIC_KEY);
+        set.add_bytes(KM_TAG_SOTER_AUTO_SIGNED_COMMON_KEY_WHEN_GET_PUBLIC_KEY_BLOB,
+                      read_input(desc.soter_sign_with_key));
+    }
+}
+
+} // namespace
 
 uint32_t digest_bits(uint32_t digest) {
     switch (digest) {
@@ -173,7 +217,8 @@ km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool gen
         add_tag_value(set, "--size", "KM_TAG_KEY_SIZE", desc.size);
     if (desc.purposes.empty()) {
         std::vector<uint32_t> all;
-        if (*alg == KM_ALGORITHM_RSA || *alg == KM_ALGORITHM_AES)
+        // A SOTER key signs statements; it has nothing to encrypt.
+        if (!desc.soter && (*alg == KM_ALGORITHM_RSA || *alg == KM_ALGORITHM_AES))
             all.insert(all.end(), {KM_PURPOSE_ENCRYPT, KM_PURPOSE_DECRYPT});
         if (*alg == KM_ALGORITHM_RSA || *alg == KM_ALGORITHM_EC || *alg == KM_ALGORITHM_HMAC)
             all.insert(all.end(), {KM_PURPOSE_SIGN, KM_PURPOSE_VERIFY});
@@ -198,6 +243,7 @@ km::ParamSet key_params(const NewKeyOptions &desc, uint32_t *algorithm, bool gen
         set.add_bytes(KM_TAG_APPLICATION_DATA, text_bytes(desc.app_data));
     for (const std::string &t : desc.tags)
         add_param_text(set, "--tag", t);
+    add_soter_tags(set, desc, *alg);
     add_key_defaults(set, *alg, generating);
     check_single_tags(set);
     return set;

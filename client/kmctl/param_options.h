@@ -49,11 +49,17 @@ struct NewKeyOptions {
     bool has_app_id = false;
     bool has_app_data = false;
     std::vector<std::string> tags;
+    // A SOTER key: its export and its signatures are signed statements.
+    bool soter = false;
+    bool soter_counter = false;
+    std::string soter_uid;
+    std::string soter_sign_with;     // "attk"
+    std::string soter_sign_with_key; // a key blob file
 };
 
 // add_new_key_options - --algorithm (required), --size, --purpose,
 // --digest, --padding, --block-mode, --min-mac-length, --exponent,
-// --app-id, --app-data and --tag on app.
+// --app-id, --app-data, --tag and the SOTER options on app.
 void add_new_key_options(CLI::App &app, NewKeyOptions &desc);
 
 // digest_bits - a digest's output length in bits; 0 for none or unknown.

@@ -14,12 +14,17 @@
 #include <openssl/rsa.h>
 
 #include "common.h"
+#include "soter_statement.h"
 #include "keymaster_defs.h"
 #include "km/key_material.h"
 #include "ta_entry.h"
 #include "tee_host.h"
 
 namespace kmctl {
+
+// add_soter_verify - `kmctl soter verify export|sign` (soter_verify.cpp).
+Command add_soter_verify(CLI::App &soter);
+
 namespace {
 
 // Defaults of the device facts, for a host that has no fingerprint sensor.
@@ -247,10 +252,18 @@ void device_id(const GlobalOptions &options) {
     std::puts(text.c_str());
 }
 
+// The notification counts from the moment the TA takes it: a signing more
+// than three seconds later no longer carries the fid.
+void notify_fid(const GlobalOptions &options, uint32_t fid) {
+    Session session(options);
+    report_fid(session.client(), fid);
+}
+
 } // namespace
 
 Command add_soter(CLI::App &kmctl, const GlobalOptions &options) {
-    CLI::App *soter = kmctl.add_subcommand("soter", "SOTER attestation: provisioning, the ATTK and the device id");
+    CLI::App *soter = kmctl.add_subcommand(
+        "soter", "SOTER attestation: provisioning, the ATTK, the device id and checking its outputs");
     soter->require_subcommand(1);
 
     auto p = std::make_shared<ProvisionOptions>();
@@ -278,6 +291,11 @@ Command add_soter(CLI::App &kmctl, const GlobalOptions &options) {
     add_out_option(*export_app, e->out, "The public key", true);
 
     CLI::App *id_app = soter->add_subcommand("device-id", "Print the device identifier in hex (command 0xFF03)");
+    auto fid = std::make_shared<uint32_t>(0);
+    CLI::App *fid_app = soter->add_subcommand(
+        "notify-fid", "Have the fingerprint TA report that fingerprint N matched (through kmd: for later signings)");
+    fid_app->add_option("fid", *fid, "The fingerprint id")->required()->type_name("N");
+    Command statement = add_soter_verify(*soter);
 
     return {soter, [=, &options] {
                 if (prov->parsed())
@@ -288,6 +306,10 @@ Command add_soter(CLI::App &kmctl, const GlobalOptions &options) {
                     export_attk(options, *e);
                 else if (id_app->parsed())
                     device_id(options);
+                else if (fid_app->parsed())
+                    notify_fid(options, *fid);
+                else if (statement.app->parsed())
+                    statement.run();
             }};
 }
 

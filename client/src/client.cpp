@@ -409,6 +409,10 @@ Exchange soter_output(Transport &transport, uint32_t cmd) {
 
 } // namespace
 
+Status Client::notify_fid(uint32_t fid) {
+    return Status{transport_.notify_fid(fid), 0};
+}
+
 Status Client::soter_load_attk() {
     return exchange(transport_, KM_CMD_SOTER_GENERATE_ATTK_KEY_PAIR, 0, nullptr, 0).status;
 }

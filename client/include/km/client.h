@@ -174,6 +174,13 @@ class Client {
     Result<std::string> soter_export_attk();
     // soter_device_id - command 0xFF03: the device identifier bytes.
     Result<Bytes> soter_device_id();
+    // notify_fid - the fingerprint TA beside the Keymaster TA reports that
+    // fingerprint fid matched (it sends command 0xFF04 itself). The
+    // Keymaster TA takes it only once its SOTER state is loaded (see
+    // soter_load_attk); a refusal is a TEE result: TEE_ERROR_ACCESS_DENIED
+    // (not loaded), TEE_ERROR_ITEM_NOT_FOUND (no fingerprint TA: the device
+    // is not provisioned), TEE_ERROR_NOT_SUPPORTED (this transport reaches none).
+    Status notify_fid(uint32_t fid);
 
   private:
     // Runs a count command then its list command with a buffer of exactly
