@@ -29,15 +29,12 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
         if (!rsa_output_alloc(&out, op->key_size, error))
             return TEE_SUCCESS;
         uint32_t len = key_bytes;
+        // A digest-length salt whenever it fits, else the longest that does.
+        const uint32_t h = rsa_digest_length(op->digest);
         TEE_Attribute salt{};
-        uint32_t attr_count = 0;
-        if (op->padding == KM_PAD_RSA_PSS) {
-            const uint32_t h = rsa_digest_length(op->digest);
-            TEE_InitValueAttribute(
-                &salt, TEE_ATTR_RSA_PSS_SALT_LENGTH,
-                (h + 1) * 2 <= key_bytes ? TEE_RSA_PSS_SALT_DIGEST_LENGTH : TEE_RSA_PSS_SALT_MAX_OR_AUTO, 0);
-            attr_count = 1;
-        }
+        const uint32_t attr_count = rsa_salt_attribute(
+            op->padding, (h + 1) * 2 <= key_bytes ? TEE_RSA_PSS_SALT_DIGEST_LENGTH : TEE_RSA_PSS_SALT_MAX_OR_AUTO,
+            &salt);
         res = TEE_AsymmetricSignDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block,
                                        op->block_len, out.get(), &len);
         if (res != TEE_SUCCESS) {

@@ -35,11 +35,7 @@ TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, c
         if (res != TEE_SUCCESS)
             return res;
         TEE_Attribute salt{};
-        uint32_t attr_count = 0;
-        if (op->padding == KM_PAD_RSA_PSS) {
-            TEE_InitValueAttribute(&salt, TEE_ATTR_RSA_PSS_SALT_LENGTH, TEE_RSA_PSS_SALT_MAX_OR_AUTO, 0);
-            attr_count = 1;
-        }
+        const uint32_t attr_count = rsa_salt_attribute(op->padding, TEE_RSA_PSS_SALT_MAX_OR_AUTO, &salt);
         res = TEE_AsymmetricVerifyDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block,
                                          op->block_len, signature, signature_len);
         if (res == TEE_ERROR_SIGNATURE_INVALID) {

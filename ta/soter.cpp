@@ -291,17 +291,10 @@ TEE_Result do_digest_with_sha(uint32_t algorithm, const uint8_t *message, uint32
 TEE_Result do_sign_with_rsa(TEE_ObjectHandle key, uint32_t key_size, const uint8_t *digest, uint32_t digest_len,
                             uint8_t *signature, uint32_t *signature_len) {
     operation_guard op;
-    TEE_Result res = TEE_AllocateOperation(op.out(), TEE_ALG_RSASSA_PKCS1_V1_5_SHA256, TEE_MODE_SIGN, key_size);
-    if (res != TEE_SUCCESS) {
-        *op.out() = TEE_HANDLE_NULL;
-        KM_ERR("TEE_AllocateOperation failed: %08x\n", res);
+    TEE_Result res = keyed_operation(op.out(), TEE_ALG_RSASSA_PKCS1_V1_5_SHA256, TEE_MODE_SIGN, key_size, key,
+                                     tee_call_texts::prefixed);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_SetOperationKey(op.get(), key);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_SetOperationKey failed: %08x\n", res);
-        return res;
-    }
     res = TEE_AsymmetricSignDigest(op.get(), nullptr, 0, digest, digest_len, signature, signature_len);
     if (res != TEE_SUCCESS)
         KM_ERR("TEE_AsymmetricSignDigest failed: %08x\n", res);
@@ -575,11 +568,7 @@ TEE_Result soter_do_sign_finish(rsa_sign_operation_t *op, const uint8_t *message
         return TEE_ERROR_OUT_OF_MEMORY;
     }
     TEE_Attribute salt{};
-    uint32_t attr_count = 0;
-    if (op->padding == KM_PAD_RSA_PSS) {
-        TEE_InitValueAttribute(&salt, TEE_ATTR_RSA_PSS_SALT_LENGTH, TEE_RSA_PSS_SALT_MAX_OR_AUTO, 0);
-        attr_count = 1;
-    }
+    const uint32_t attr_count = rsa_salt_attribute(op->padding, TEE_RSA_PSS_SALT_MAX_OR_AUTO, &salt);
     uint32_t len = key_bytes;
     res = TEE_AsymmetricSignDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block, op->block_len,
                                    out.get(), &len);

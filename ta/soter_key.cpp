@@ -446,16 +446,10 @@ TEE_ObjectHandle retrieve_key_from_pobj(const uint8_t *blob, uint32_t blob_len, 
 TEE_Result export_rsa_public_key(TEE_ObjectHandle key, uint32_t key_size, uint8_t *dest, uint32_t capacity,
                                  uint32_t *out_len) {
     operation_guard op;
-    TEE_Result res = TEE_AllocateOperation(op.out(), TEE_ALG_RSA_NOPAD, TEE_MODE_EXPORT, key_size);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_AllocateOperation failed: %08x\n", res);
+    TEE_Result res =
+        keyed_operation(op.out(), TEE_ALG_RSA_NOPAD, TEE_MODE_EXPORT, key_size, key, tee_call_texts::prefixed);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_SetOperationKey(op.get(), key);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_SetOperationKey failed: %08x\n", res);
-        return res;
-    }
     *out_len = capacity;
     res = TEE_AsymmetricExport(op.get(), TEE_EXPORT_RSA_PUBLIC_KEY_DER, dest, out_len);
     if (res != TEE_SUCCESS) {

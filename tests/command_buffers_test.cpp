@@ -30,11 +30,7 @@ class CommandBuffers : public KeyTest {
         ParamSet rsa;
         rsa.add(KM_TAG_ALGORITHM, KM_ALGORITHM_RSA).add_bool(KM_TAG_NO_AUTH_REQUIRED);
         rsa.add(KM_TAG_PURPOSE, KM_PURPOSE_SIGN).add(KM_TAG_PADDING, KM_PAD_NONE).add(KM_TAG_DIGEST, KM_DIGEST_NONE);
-        std::string why;
-        auto material = km::rsa_import_material(
-            std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(kRsa1024Pem), std::strlen(kRsa1024Pem)), &why);
-        ASSERT_TRUE(material.has_value()) << why;
-        ASSERT_TRUE(import(rsa, *material, &rsa_blob_).ok()) << dump_log();
+        ASSERT_TRUE(import(rsa, rsa_material(kRsa1024Pem), &rsa_blob_).ok()) << dump_log();
         ASSERT_TRUE(generate(hmac_params(), &hmac_blob_).ok()) << dump_log();
         hmac_material_ = Bytes(32, 0x42);
     }

@@ -33,15 +33,6 @@ Pkey load_pem(const char *pem) {
     return Pkey(k, EVP_PKEY_free);
 }
 
-// The TA's import material, made by the client library from the PEM.
-Bytes material_of(const char *pem) {
-    std::string why;
-    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)),
-                                     &why);
-    EXPECT_TRUE(m.has_value()) << why;
-    return m.value_or(Bytes{});
-}
-
 // One OpenSSL public- or private-key operation with the given padding settings.
 enum class Op { Sign, Verify, Encrypt, Decrypt, VerifyRecover };
 struct Pad {
@@ -138,7 +129,7 @@ class Rsa : public KeyTest {
         for (const auto &x : extra.params())
             p.add(x.tag, x.value);
         Bytes blob;
-        EXPECT_TRUE(import(p, material_of(pem), &blob).ok()) << dump_log();
+        EXPECT_TRUE(import(p, rsa_material(pem), &blob).ok()) << dump_log();
         return blob;
     }
     Pkey exported(const Bytes &blob) {
@@ -161,7 +152,7 @@ class Rsa : public KeyTest {
 };
 
 TEST_F(Rsa, ImportCompletesTheParametersAndKeepsTheMaterial) {
-    Bytes material = material_of(kRsa2048Pem);
+    Bytes material = rsa_material(kRsa2048Pem);
     ParamSet p = key_params();
     Bytes blob, chars;
     Bytes with_tail = material;
@@ -434,7 +425,7 @@ TEST_F(Rsa, BeginRefusesPaddingAndDigestCombinations) {
     ParamSet soter = key_params();
     soter.add_bool(KM_TAG_SOTER_IS_FROM_SOTER);
     Bytes soter_blob;
-    ASSERT_TRUE(import(soter, material_of(kRsa1024Pem), &soter_blob).ok());
+    ASSERT_TRUE(import(soter, rsa_material(kRsa1024Pem), &soter_blob).ok());
     // An unprovisioned device has no SOTER state to sign documents with.
     tee_host::trace::clear();
     EXPECT_EQ(begin(KM_PURPOSE_SIGN, soter_blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), &h).error,

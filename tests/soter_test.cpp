@@ -25,14 +25,6 @@ using km::ParamSet;
 // The fingerprint TA the factory data names.
 constexpr TEE_UUID kFingerprintTa = {0x0fb1c2d3, 0x4e5f, 0x4a6b, {0x9c, 0x8d, 0x7e, 0x6f, 0x50, 0x41, 0x32, 0x23}};
 
-Bytes material_of(const char *pem) {
-    std::string why;
-    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)),
-                                     &why);
-    EXPECT_TRUE(m.has_value()) << why;
-    return m.value_or(Bytes{});
-}
-
 // The PEM text the TA makes of a key's public half: the base64 of its
 // SubjectPublicKeyInfo on one line between the two armour lines.
 std::string public_pem(const char *pem) {
@@ -128,7 +120,7 @@ class Soter : public KeyTest {
         p.add_bool(KM_TAG_NO_AUTH_REQUIRED);
         p.add_bool(KM_TAG_SOTER_IS_FROM_SOTER);
         Bytes blob;
-        EXPECT_TRUE(import(p, material_of(pem), &blob, nullptr, 16384).ok()) << dump_log();
+        EXPECT_TRUE(import(p, rsa_material(pem), &blob, nullptr, 16384).ok()) << dump_log();
         return blob;
     }
     static ParamSet attk_signed(bool counter, std::optional<uint32_t> uid) {

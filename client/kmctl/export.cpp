@@ -33,11 +33,12 @@ Command add_export(CLI::App &kmctl, const GlobalOptions &options) {
     CLI::Option *out = add_out_option(*app, o->out, "The public key (SOTER key: the signed statement)", true);
     add_statement_options(*app, o->statement, out);
     return {app, [o, out, &options] {
+                check_statement_outputs(o->statement, out, "export");
                 km::KeyReference key = key_reference(o->key);
                 Session session(options);
                 km::ParamSet chars = take(session.client().characteristics(key));
                 const bool soter = is_soter_key(chars);
-                check_statement_request(o->statement, out, soter, "export");
+                check_statement_key(o->statement, soter);
                 km::Bytes exported = take(session.client().export_key(key));
                 if (soter) {
                     write_statement(o->out, out, o->statement, exported, false);

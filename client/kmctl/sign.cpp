@@ -32,12 +32,13 @@ Command add_sign(CLI::App &kmctl, const GlobalOptions &options) {
         ->type_name("N");
     return {app, [o, out, &options] {
                 check_one_stdin({{"--key", &o->op.key.blob_path}, {"--in", &o->op.in}});
+                check_statement_outputs(o->statement, out, "sign");
                 km::ParamSet params = begin_params(o->op);
                 km::KeyReference key = key_reference(o->op.key);
                 InputStream in(o->op.in);
                 Session session(options);
                 const bool soter = is_soter_key(take(session.client().characteristics(key)));
-                check_statement_request(o->statement, out, soter, "sign");
+                check_statement_key(o->statement, soter);
                 if (o->fid && !soter)
                     usage_error("--fid: the fingerprint goes into SOTER statements; this key is not a SOTER key");
                 complete_params(session.client(), key, params, KM_PURPOSE_SIGN, 0);

@@ -27,11 +27,14 @@ bool is_soter_key(const km::ParamSet &chars) {
     return chars.find(KM_TAG_SOTER_IS_FROM_SOTER) != nullptr;
 }
 
-void check_statement_request(const StatementOutputs &s, CLI::Option *out, bool soter, const std::string &command) {
+void check_statement_outputs(const StatementOutputs &s, CLI::Option *out, const std::string &command) {
+    if (!s.split() && out->count() == 0)
+        usage_error(command + " needs --out (or, for a SOTER key, --json-out and --signature-out)");
+}
+
+void check_statement_key(const StatementOutputs &s, bool soter) {
     if (s.split() && !soter)
         usage_error("--json-out and --signature-out split a SOTER statement; this key is not a SOTER key");
-    if (!s.split() && out->count() == 0)
-        usage_error(command + " needs --out" + (soter ? " (or --json-out and --signature-out)" : ""));
 }
 
 void write_statement(const std::string &out_path, CLI::Option *out, const StatementOutputs &s, const km::Bytes &output,

@@ -28,9 +28,12 @@ void add_statement_options(CLI::App &app, StatementOutputs &s, CLI::Option *out)
 // is_soter_key - whether the key's characteristics mark it a SOTER key.
 bool is_soter_key(const km::ParamSet &chars);
 
-// check_statement_request - refuses (usage) a split for a key that is not
-// a SOTER key, and no output at all.
-void check_statement_request(const StatementOutputs &s, CLI::Option *out, bool soter, const std::string &command);
+// check_statement_outputs - refuses (usage) a command line that sends the
+// output nowhere; before any TEE starts.
+void check_statement_outputs(const StatementOutputs &s, CLI::Option *out, const std::string &command);
+
+// check_statement_key - refuses (usage) a split for a key that is not a SOTER key.
+void check_statement_key(const StatementOutputs &s, bool soter);
 
 // write_statement - the output as it came to --out, and/or its signed
 // document (a signing document with its NUL) to --json-out and its

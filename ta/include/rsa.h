@@ -126,6 +126,18 @@ TEE_Result rsa_raw(rsa_operation_t *op, rsa_raw_call call, const uint8_t *in, ui
  */
 void rsa_left_pad(uint8_t *out, uint32_t *len, uint32_t key_size);
 
+/*
+ * rsa_salt_attribute - the attributes of a signature call: for PSS one
+ * TEE_ATTR_RSA_PSS_SALT_LENGTH with a = salt in *attr, and the count 1;
+ * for any other padding none, and 0.
+ */
+inline uint32_t rsa_salt_attribute(uint32_t padding, uint32_t salt, TEE_Attribute *attr) {
+    if (padding != KM_PAD_RSA_PSS)
+        return 0;
+    TEE_InitValueAttribute(attr, TEE_ATTR_RSA_PSS_SALT_LENGTH, salt, 0);
+    return 1;
+}
+
 /* The digest's length in bytes (KM_DIGEST_MD5..SHA_2_512), 0 otherwise. */
 uint32_t rsa_digest_length(uint32_t digest);
 

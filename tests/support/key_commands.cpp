@@ -4,11 +4,13 @@
 #include "key_commands.h"
 
 #include <algorithm>
+#include <cstring>
 
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
 
 #include "keymaster_defs.h"
+#include "km/key_material.h"
 #include "ta_entry.h"
 
 const EVP_MD *md_for(uint32_t digest) {
@@ -28,6 +30,14 @@ const EVP_MD *md_for(uint32_t digest) {
     default:
         return nullptr;
     }
+}
+
+Bytes rsa_material(const char *pem) {
+    std::string why;
+    auto m = km::rsa_import_material(std::span<const uint8_t>(reinterpret_cast<const uint8_t *>(pem), std::strlen(pem)),
+                                     &why);
+    EXPECT_TRUE(m.has_value()) << why;
+    return m.value_or(Bytes{});
 }
 
 Bytes key_reference(const Bytes &blob, const Bytes &app_id, const Bytes &app_data) {

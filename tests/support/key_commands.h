@@ -12,6 +12,10 @@ struct evp_md_st;
 // md_for - OpenSSL's digest for a Keymaster digest (MD5 to SHA-512), null otherwise.
 const evp_md_st *md_for(uint32_t digest);
 
+// rsa_material - the TA's RSA import material of a private key text, made
+// by the client library (a test failure and empty when it does not decode).
+Bytes rsa_material(const char *pem);
+
 // The three-field key reference of the characteristics and export commands.
 Bytes key_reference(const Bytes &blob, const Bytes &app_id = {}, const Bytes &app_data = {});
 
