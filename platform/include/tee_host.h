@@ -166,6 +166,23 @@ using Stats = PreparedKeyStats;
 Stats stats();
 } // namespace ec_cache
 
+// Power cuts, for crash-safety tests run in a child process: every file
+// the platform replaces (stored objects, the factory store) goes through
+// one atomic write, and the process can be made to end (_exit with
+// kExitCode) at one of its steps, as if the machine lost power there.
+namespace crash {
+enum class Point {
+    partial_write, // half of the temporary file written
+    written,       // the temporary written, not synced
+    synced,        // the temporary synced, not yet renamed
+    renamed,       // renamed over the target, directory not synced
+};
+constexpr int kExitCode = 86;
+// die_at - the nth atomic write from now (1: the next) to reach `point` ends the process there.
+void die_at(Point point, uint64_t nth = 1);
+void disarm();
+} // namespace crash
+
 // Trace lines as the TA emitted them.
 namespace trace {
 struct Line {

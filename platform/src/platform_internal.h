@@ -5,6 +5,7 @@
 #define PLATFORM_INTERNAL_H
 
 #include <cstdint>
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
@@ -52,6 +53,15 @@ struct Globals {
     CryptoStatePtr crypto;
 };
 Globals &globals();
+
+// atomic_write - data becomes `file` (mode 0600) through the temporary
+// `tmp`: written, synced, renamed over it (exclusive: linked, so EEXIST
+// when a file is there, nothing replaced), the directory synced. 0 or an
+// errno; a failure leaves the old file and no temporary.
+int atomic_write(const std::filesystem::path &file, const std::filesystem::path &tmp, const uint8_t *data, size_t n,
+                 bool exclusive);
+// sync_dir - fsync of a directory; 0 or an errno.
+int sync_dir(const std::filesystem::path &dir);
 
 // Formats and parses the canonical 8-4-4-4-12 text form of a UUID.
 std::string uuid_to_string(const TEE_UUID &u);

@@ -133,43 +133,12 @@ TEE_Result load(const fs::path &state_dir, Stored *out) {
     return TEE_SUCCESS;
 }
 
-int sync_dir(const fs::path &dir) {
-    int fd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0)
-        return errno;
-    int err = ::fsync(fd) == 0 ? 0 : errno;
-    ::close(fd);
-    return err;
-}
-
 // write_atomically - bytes become the file at path, or nothing changes.
+// Each process writes its own temporary: several may provision at once.
 bool write_atomically(const fs::path &path, const std::vector<uint8_t> &bytes) {
     fs::path tmp = path;
-    tmp += ".tmp";
-    int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd < 0)
-        return false;
-    const uint8_t *p = bytes.data();
-    size_t left = bytes.size();
-    bool ok = true;
-    while (left && ok) {
-        ssize_t w = ::write(fd, p, left);
-        if (w < 0 && errno == EINTR)
-            continue;
-        ok = w > 0;
-        if (ok) {
-            p += w;
-            left -= static_cast<size_t>(w);
-        }
-    }
-    ok = ok && ::fsync(fd) == 0;
-    ok = ::close(fd) == 0 && ok;
-    ok = ok && ::rename(tmp.c_str(), path.c_str()) == 0;
-    if (!ok) {
-        ::unlink(tmp.c_str());
-        return false;
-    }
-    return sync_dir(path.parent_path()) == 0;
+    tmp += ".tmp." + std::to_string(::getpid());
+    return detail::atomic_write(path, tmp, bytes.data(), bytes.size(), false) == 0;
 }
 
 // Which property a 4-byte request asks for; false for anything else.

@@ -200,28 +200,6 @@ TEE_Result io_error(int err) {
     return err == ENOSPC || err == EDQUOT ? TEE_ERROR_STORAGE_NO_SPACE : TEE_ERROR_STORAGE_NOT_AVAILABLE;
 }
 
-int sync_dir(const fs::path &dir) {
-    int fd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0)
-        return errno;
-    int err = ::fsync(fd) == 0 ? 0 : errno;
-    ::close(fd);
-    return err;
-}
-
-int write_all(int fd, const uint8_t *p, size_t n) {
-    while (n) {
-        ssize_t w = ::write(fd, p, n);
-        if (w < 0 && errno == EINTR)
-            continue;
-        if (w <= 0)
-            return w < 0 ? errno : EIO;
-        p += w;
-        n -= static_cast<size_t>(w);
-    }
-    return 0;
-}
-
 // replace_file - makes `bytes` the object's file, atomically. exclusive:
 // only when no file is there yet (another process may be creating the same
 // object), TEE_ERROR_ACCESS_CONFLICT when one is.
@@ -230,29 +208,9 @@ TEE_Result replace_file(const StoredObject &o, const SecretBytes &bytes, bool ex
     fs::create_directories(o.dir, ec);
     if (ec)
         return io_error(ec.value());
-    fs::path tmp = o.own_temp();
-    int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd < 0)
-        return io_error(errno);
-    int err = write_all(fd, bytes.data(), bytes.size());
-    if (!err && ::fsync(fd) != 0)
-        err = errno;
-    if (::close(fd) != 0 && !err)
-        err = errno;
-    if (!err && exclusive) {
-        // link() never replaces: of several creators exactly one wins.
-        err = ::link(tmp.c_str(), o.file().c_str()) == 0 ? 0 : errno;
-        ::unlink(tmp.c_str());
-        if (err == EEXIST)
-            return TEE_ERROR_ACCESS_CONFLICT;
-    } else if (!err && ::rename(tmp.c_str(), o.file().c_str()) != 0) {
-        err = errno;
-    }
-    if (err) {
-        ::unlink(tmp.c_str());
-        return io_error(err);
-    }
-    err = sync_dir(o.dir);
+    int err = atomic_write(o.file(), o.own_temp(), bytes.data(), bytes.size(), exclusive);
+    if (err == EEXIST && exclusive)
+        return TEE_ERROR_ACCESS_CONFLICT;
     return err ? io_error(err) : TEE_SUCCESS;
 }
 
