@@ -324,6 +324,7 @@ TEST_F(KeyManagement, AllocationFailuresLeaveNothingBehind) {
     const Outcome oom{TEE_ERROR_OUT_OF_MEMORY, 0};
     const Outcome unparsed{TEE_ERROR_BAD_PARAMETERS, 0};
     const Outcome provider_oom{TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED};
+    const uint32_t trusted = open(&trusted_client_uuids[0]);
     // Opening a blob: its buffers (-41), its parameter set (-38), the TEE's objects.
     const std::vector<Outcome> opening = {oom, provider_oom, {TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}};
     struct Step {
@@ -362,9 +363,17 @@ TEST_F(KeyManagement, AllocationFailuresLeaveNothingBehind) {
              return export_key(key_reference(blob), &c);
          },
          opening},
+        // A trusted TA opening the blob raw: TEE results only.
+        {"open raw",
+         [&] {
+             Bytes payload;
+             return Outcome{open_raw(trusted, blob, &payload), 0};
+         },
+         {oom}},
     };
     for (const Step &step : steps)
         EXPECT_GT(sweep_allocations(step.name, nullptr, step.run, step.allowed), 0) << step.name;
+    tee_->close_session(trusted);
 }
 
 } // namespace

@@ -579,39 +579,61 @@ TEST_F(Rsa, AllocationFailuresInRsaOperations) {
     Bytes blob = import_pem(kRsa1024Pem);
     const Outcome oom{TEE_ERROR_OUT_OF_MEMORY, 0};
     const Outcome provider_oom{TEE_SUCCESS, KM_ERROR_MEMORY_ALLOCATION_FAILED};
-    const char *names[] = {"begin", "update", "finish"};
-    for (uint32_t step = 0; step < 3; ++step) {
-        uint32_t h = 0;
-        std::vector<Outcome> allowed = {oom, provider_oom};
-        if (step == 0) {
-            allowed.push_back({TEE_ERROR_BAD_PARAMETERS, 0});            // begin parameters not parsed
-            allowed.push_back({TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}); // the blob's parameters not parsed
-            allowed.push_back({TEE_SUCCESS, KM_ERROR_UNKNOWN_ERROR});    // a TEE object or operation not made
-        } else
-            allowed.push_back({TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}); // update/finish parameters not parsed
-        int n = sweep_allocations(
-            names[step],
-            [&] {
-                if (step > 0) {
-                    ASSERT_TRUE(begin(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), &h).ok());
-                }
-            },
-            [&] {
-                Outcome o{};
-                if (step == 0)
-                    o = begin(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), &h);
-                else if (step == 1)
-                    o = update(h, sample(64, 1));
-                else
-                    o = finish(h);
-                Outcome after = abort(h);
-                if (tee_host::heap::injected_failure_fired()) {
-                    EXPECT_EQ(after.error, KM_ERROR_INVALID_OPERATION_HANDLE) << names[step];
-                }
-                return o;
-            },
-            allowed);
-        EXPECT_GT(n, 0) << names[step];
+    const Outcome unparsed{TEE_SUCCESS, KM_ERROR_INVALID_ARGUMENT}; // a parameter set not parsed
+    const Bytes msg = sample(64, 1);
+    Bytes sig, ct;
+    ASSERT_TRUE(ta(KM_PURPOSE_SIGN, blob, op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), msg, &sig).ok());
+    const Bytes secret = sample(32, 2); // within OAEP-SHA-256's room in a 1024-bit key
+    ASSERT_TRUE(ta(KM_PURPOSE_ENCRYPT, blob, op_params(KM_PAD_RSA_OAEP, 4), secret, &ct).ok());
+    const struct {
+        uint32_t purpose;
+        const char *name;
+        ParamSet params;
+        Bytes input;
+        Bytes signature;
+    } purposes[] = {
+        {KM_PURPOSE_SIGN, "sign", op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), msg, {}},
+        {KM_PURPOSE_VERIFY, "verify", op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, 4), msg, sig},
+        {KM_PURPOSE_ENCRYPT, "encrypt", op_params(KM_PAD_RSA_OAEP, 4), secret, {}},
+        {KM_PURPOSE_DECRYPT, "decrypt", op_params(KM_PAD_RSA_OAEP, 4), ct, {}},
+    };
+    const char *steps[] = {"begin", "update", "finish"};
+    for (const auto &pp : purposes) {
+        for (uint32_t step = 0; step < 3; ++step) {
+            uint32_t h = 0;
+            std::vector<Outcome> allowed = {oom, provider_oom, unparsed};
+            if (step == 0) {
+                allowed.push_back({TEE_ERROR_BAD_PARAMETERS, 0});         // begin parameters not parsed
+                allowed.push_back({TEE_SUCCESS, KM_ERROR_UNKNOWN_ERROR}); // a TEE object or operation not made
+            }
+            const std::string what = std::string(steps[step]) + " " + pp.name;
+            int n = sweep_allocations(
+                what,
+                [&] {
+                    if (step > 0) {
+                        ASSERT_TRUE(begin(pp.purpose, blob, pp.params, &h).ok()) << what;
+                    }
+                    if (step > 1) {
+                        ASSERT_TRUE(update(h, pp.input).ok()) << what;
+                    }
+                },
+                [&] {
+                    Outcome o{};
+                    if (step == 0)
+                        o = begin(pp.purpose, blob, pp.params, &h);
+                    else if (step == 1)
+                        o = update(h, pp.input);
+                    else
+                        o = finish(h, pp.signature);
+                    Outcome after = abort(h);
+                    if (tee_host::heap::injected_failure_fired()) {
+                        EXPECT_EQ(after.error, KM_ERROR_INVALID_OPERATION_HANDLE) << what << ": a failed step ends it";
+                    }
+                    return o;
+                },
+                allowed);
+            EXPECT_GT(n, 0) << what;
+        }
     }
 }
 
