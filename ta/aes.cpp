@@ -164,95 +164,61 @@ bool hold_back_buffer(uint8_t **buf, uint32_t len, int32_t *error, const char *f
 
 TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    return provider_key_slot(
-        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = provider_key_size(params, error, "aes_generate_key");
-            if (!size)
-                return false;
-            const uint32_t key_size = size->integer;
-            if (!valid_key_size(key_size)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Invalid AES key size %d",
-                            static_cast<int>(key_size));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            check_min_mac_length(params, error, "aes_generate_key");
-            if (*error)
-                return false;
+    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
+                             [&](heap_buf *buf, TEE_Result *res) {
+                                 const key_param_t *size = provider_key_size(params, error, "aes_generate_key");
+                                 if (!size)
+                                     return false;
+                                 const uint32_t key_size = size->integer;
+                                 if (!valid_key_size(key_size)) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
+                                                 "Invalid AES key size %d", static_cast<int>(key_size));
+                                     *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                                     return false;
+                                 }
+                                 check_min_mac_length(params, error, "aes_generate_key");
+                                 if (*error)
+                                     return false;
 
-            object_guard obj;
-            *res = TEE_AllocateTransientObject(TEE_TYPE_AES, key_size, obj.out());
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
-                            "AllocateTransientObject failed with 0x%08x\n", *res);
-                return false;
-            }
-            *res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", *res);
-                return false;
-            }
-            const uint32_t key_bytes = key_size / 8;
-            if (!buf->alloc(kKeyDataHeader + key_bytes)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Out of memory");
-                *res = TEE_ERROR_OUT_OF_MEMORY;
-                return false;
-            }
-            byte_writer w(buf->get(), buf->len());
-            uint8_t *key = nullptr;
-            if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
-                *res = TEE_ERROR_GENERIC;
-                return false;
-            }
-            uint32_t got = key_bytes;
-            *res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, key, &got);
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
-                            "GetObjectBufferAttribute failed with 0x%08x\n", *res);
-                return false;
-            }
-            if (got != key_bytes) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
-                            "Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes),
-                            static_cast<int>(got));
-                *error = KM_ERROR_UNKNOWN_ERROR;
-                return false;
-            }
-            return true;
-        });
+                                 const uint32_t key_bytes = key_size / 8;
+                                 if (!buf->alloc(kKeyDataHeader + key_bytes)) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Out of memory");
+                                     *res = TEE_ERROR_OUT_OF_MEMORY;
+                                     return false;
+                                 }
+                                 byte_writer w(buf->get(), buf->len());
+                                 uint8_t *key = nullptr;
+                                 if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
+                                     *res = TEE_ERROR_GENERIC;
+                                     return false;
+                                 }
+                                 *res = provider_secret_key(TEE_TYPE_AES, key_size, key, error, "aes_generate_key");
+                                 if (*res != TEE_SUCCESS || *error)
+                                     return false;
+                                 return true;
+                             });
 }
 
 TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_key_slot(
-        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Invalid AES key size %d", -1);
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            const uint32_t guessed = material_len * 8;
-            *res = provider_check_key_size(params, guessed, error, "aes_import_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            if (!valid_key_size(guessed)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Invalid AES key size %d",
-                            static_cast<int>(guessed));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            if (!buf->alloc(kKeyDataHeader + material_len)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Out of memory");
-                *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-                return false;
-            }
-            byte_writer w(buf->get(), buf->len());
-            if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
-                *res = TEE_ERROR_GENERIC;
-                return false;
-            }
-            return true;
-        });
+    return provider_key_slot(params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
+                             [&](heap_buf *buf, TEE_Result *res) {
+                                 uint32_t guessed = 0;
+                                 if (!provider_raw_key_size(params, material_len, kKeyDataHeader, valid_key_size, "AES",
+                                                            &guessed, res, error, "aes_import_key"))
+                                     return false;
+                                 if (!buf->alloc(kKeyDataHeader + material_len)) {
+                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Out of memory");
+                                     *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+                                     return false;
+                                 }
+                                 byte_writer w(buf->get(), buf->len());
+                                 if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
+                                     *res = TEE_ERROR_GENERIC;
+                                     return false;
+                                 }
+                                 return true;
+                             });
 }
 
 TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

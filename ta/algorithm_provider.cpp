@@ -4,6 +4,8 @@
  */
 #include "algorithm_provider.h"
 
+#include "tee_guard.h"
+
 #include "ta_log.h"
 
 const algorithm_provider_t *const algorithm_providers[kAlgorithmProviderCount] = {
@@ -142,6 +144,53 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
     if (res != TEE_SUCCESS)
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
     return res;
+}
+
+TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func) {
+    object_guard obj;
+    TEE_Result res = TEE_AllocateTransientObject(type, key_size, obj.out());
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
+        return res;
+    }
+    res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "GenerateKey failed with 0x%08x\n", res);
+        return res;
+    }
+    const uint32_t key_bytes = key_size / 8;
+    uint32_t got = key_bytes;
+    res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, dest, &got);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "GetObjectBufferAttribute failed with 0x%08x\n", res);
+        return res;
+    }
+    if (got != key_bytes) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Buffer size modified, before %dB, after %dB",
+                    static_cast<int>(key_bytes), static_cast<int>(got));
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    }
+    return TEE_SUCCESS;
+}
+
+bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
+                           bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
+                           const char *func) {
+    if (material_len > (UINT32_MAX - header) / 8) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", label, -1);
+        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+        return false;
+    }
+    *bits = material_len * 8;
+    *res = provider_check_key_size(params, *bits, error, func);
+    if (*res != TEE_SUCCESS || *error)
+        return false;
+    if (!valid(*bits)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", label, static_cast<int>(*bits));
+        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+        return false;
+    }
+    return true;
 }
 
 TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error, const char *func) {

@@ -124,70 +124,37 @@ TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_da
             if (*res != TEE_SUCCESS || *error)
                 return false;
 
-            object_guard obj;
-            *res = TEE_AllocateTransientObject(row->key_type, key_size, obj.out());
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
-                            "AllocateTransientObject failed with 0x%08x\n", *res);
-                return false;
-            }
-            *res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", *res);
-                return false;
-            }
             const uint32_t key_bytes = key_size / 8;
             *res = start_key_data(buf, key_size, row->key_type, key_bytes, 0, error, "hmac_generate_key");
             if (*res != TEE_SUCCESS || *error)
                 return false;
-            uint32_t got = key_bytes;
-            *res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, buf->get() + kKeyDataHeader, &got);
-            if (*res != TEE_SUCCESS) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
-                            "GetObjectBufferAttribute failed with 0x%08x\n", *res);
+            *res =
+                provider_secret_key(row->key_type, key_size, buf->get() + kKeyDataHeader, error, "hmac_generate_key");
+            if (*res != TEE_SUCCESS || *error)
                 return false;
-            }
-            if (got != key_bytes) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__,
-                            "Buffer size modified, before %dB, after %dB", static_cast<int>(key_bytes),
-                            static_cast<int>(got));
-                *error = KM_ERROR_UNKNOWN_ERROR;
-                return false;
-            }
             return true;
         });
 }
 
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                            uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_key_slot(
-        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            if (material_len > (UINT32_MAX - kKeyDataHeader) / 8) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_import_key", __LINE__, "Invalid hmac key size %d", -1);
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            const uint32_t guessed = material_len * 8;
-            *res = provider_check_key_size(params, guessed, error, "hmac_import_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            if (!valid_bit_length(guessed)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_import_key", __LINE__, "Invalid hmac key size %d",
-                            static_cast<int>(guessed));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            const hmac_digest_t *row = nullptr;
-            *res = check_mac_length_and_digest(params, guessed, &row, error, "hmac_import_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            *res = start_key_data(buf, guessed, row->key_type, material_len, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
-                                  "hmac_import_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            TEE_MemMove(buf->get() + kKeyDataHeader, material, material_len);
-            return true;
-        });
+    return provider_key_slot(params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
+                             [&](heap_buf *buf, TEE_Result *res) {
+                                 uint32_t guessed = 0;
+                                 if (!provider_raw_key_size(params, material_len, kKeyDataHeader, valid_bit_length,
+                                                            "hmac", &guessed, res, error, "hmac_import_key"))
+                                     return false;
+                                 const hmac_digest_t *row = nullptr;
+                                 *res = check_mac_length_and_digest(params, guessed, &row, error, "hmac_import_key");
+                                 if (*res != TEE_SUCCESS || *error)
+                                     return false;
+                                 *res = start_key_data(buf, guessed, row->key_type, material_len,
+                                                       KM_ERROR_MEMORY_ALLOCATION_FAILED, error, "hmac_import_key");
+                                 if (*res != TEE_SUCCESS || *error)
+                                     return false;
+                                 TEE_MemMove(buf->get() + kKeyDataHeader, material, material_len);
+                                 return true;
+                             });
 }
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

@@ -256,6 +256,25 @@ TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, cons
                                    uint32_t max_len, heap_buf *buf, int32_t *error, const char *func);
 
 /*
+ * provider_secret_key - a new key_size-bit secret of TEE object type
+ * `type`, written into dest (key_size / 8 bytes). The TEE's result, or
+ * TEE_SUCCESS with *error -1000 when it hands back another length; each
+ * failure logged in func's name.
+ */
+TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func);
+
+/*
+ * provider_raw_key_size - the size in bits of raw key material of
+ * material_len bytes, to be stored after `header` bytes: a length whose
+ * bits overflow, or that valid() refuses, is "Invalid <label> key size %d"
+ * with *error -6; a KM_TAG_KEY_SIZE that disagrees is refused as
+ * provider_check_key_size says. True, with *bits, when usable.
+ */
+bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
+                           bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
+                           const char *func);
+
+/*
  * provider_check_key_size - an import's key size: the caller's
  * KM_TAG_KEY_SIZE must equal the size the material shows ("Key size
  * mismatch (given %d, guessed %d)", *error -44); without one, the guessed
