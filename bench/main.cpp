@@ -33,7 +33,7 @@ Bytes message(size_t n) {
 
 namespace {
 
-const RowGroup kRowGroups[] = {hmac_rows, rsa_rows, ec_rows, aes_rows};
+const RowGroup kRowGroups[] = {hmac_rows, rsa_rows, ec_rows, aes_rows, kmd_rows};
 
 std::string ta_name(const Row &r) {
     return "ta/" + r.algorithm + "/" + r.size;

@@ -41,6 +41,8 @@ std::vector<Row> rsa_rows(TaSession &ta);
 std::vector<Row> ec_rows(TaSession &ta);
 // The AES rows: 256-bit GCM of 1 MiB and 1 KiB, 128-bit CBC with PKCS#7 of 1 MiB.
 std::vector<Row> aes_rows(TaSession &ta);
+// HMAC-SHA-256 of 64 bytes through kmd's socket beside the embedded TA.
+std::vector<Row> kmd_rows(TaSession &ta);
 
 } // namespace bench
 

@@ -13,9 +13,6 @@
 namespace bench {
 namespace {
 
-constexpr uint32_t kTypesInOut = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, TEE_PARAM_TYPE_MEMREF_INPUT,
-                                                 TEE_PARAM_TYPE_MEMREF_OUTPUT, TEE_PARAM_TYPE_NONE);
-
 // (u32 length, data, u32 length, serialized parameters): the request of
 // begin, update and finish alike.
 Bytes two_fields(const Bytes &first, const Bytes &params) {
@@ -65,19 +62,8 @@ TaSession::~TaSession() {
 }
 
 Reply TaSession::invoke(uint32_t command, uint32_t a, const Bytes &in, Bytes &out) {
-    TEE_Param p[4] = {};
-    p[0].value.a = a;
-    // The TA only reads an input memref; the API type is not const.
-    p[1].memref.buffer = const_cast<uint8_t *>(in.data());
-    p[1].memref.size = static_cast<uint32_t>(in.size());
-    p[2].memref.buffer = out.data();
-    p[2].memref.size = static_cast<uint32_t>(out.size());
-    Reply r;
-    r.res = tee_->invoke(session_, command, kTypesInOut, p);
-    r.error = static_cast<int32_t>(p[0].value.a);
-    r.b = p[0].value.b;
-    r.out_len = p[2].memref.size;
-    return r;
+    return call_with([&](uint32_t types, TEE_Param *p) { return tee_->invoke(session_, command, types, p); }, a, in,
+                     out);
 }
 
 Bytes TaSession::import_key(const km::ParamSet &params, const Bytes &material) {

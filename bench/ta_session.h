@@ -29,6 +29,27 @@ struct Reply {
     bool ok() const { return res == TEE_SUCCESS && error == 0; }
 };
 
+// call_with - runs one command through `send` (which takes the types word
+// and the parameters) with value a in params[0], the request in params[1]
+// and the response buffer in params[2]; out keeps its size.
+template <typename Send> Reply call_with(Send &&send, uint32_t a, const Bytes &in, Bytes &out) {
+    TEE_Param p[4] = {};
+    p[0].value.a = a;
+    // The TA only reads an input memref; the API type is not const.
+    p[1].memref.buffer = const_cast<uint8_t *>(in.data());
+    p[1].memref.size = static_cast<uint32_t>(in.size());
+    p[2].memref.buffer = out.data();
+    p[2].memref.size = static_cast<uint32_t>(out.size());
+    Reply r;
+    r.res = send(TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, TEE_PARAM_TYPE_MEMREF_INPUT, TEE_PARAM_TYPE_MEMREF_OUTPUT,
+                                 TEE_PARAM_TYPE_NONE),
+                 p);
+    r.error = static_cast<int32_t>(p[0].value.a);
+    r.b = p[0].value.b;
+    r.out_len = p[2].memref.size;
+    return r;
+}
+
 // Thrown when the TA refuses: a benchmark of a failing operation means nothing.
 class TaFailure : public std::runtime_error {
   public:

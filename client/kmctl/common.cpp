@@ -19,15 +19,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "km/socket_transport.h"
+#include "km/state_dir.h"
 #include "tee_api_extensions.h"
 
 namespace kmctl {
 namespace {
-
-std::string env(const char *name) {
-    const char *v = std::getenv(name);
-    return v ? std::string(v) : std::string();
-}
 
 std::filesystem::path make_state_dir(const GlobalOptions &options) {
     std::filesystem::path dir = options.state_given ? std::filesystem::path(options.state_dir) : default_state_dir();
@@ -52,8 +49,10 @@ StateLock::StateLock(const std::filesystem::path &dir) {
     fd_ = ::open(file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd_ < 0)
         throw Failure(kExitLocal, "cannot lock the state directory " + dir.string() + ": " + std::strerror(errno));
-    if (::flock(fd_, LOCK_EX | LOCK_NB) == 0)
+    if (::flock(fd_, LOCK_EX | LOCK_NB) == 0) {
+        refuse_if_kmd_serves(dir);
         return;
+    }
     // Another kmctl has the TEE: wait for it, and say so if it takes a while.
     std::mutex mu;
     std::condition_variable cv;
@@ -77,6 +76,22 @@ StateLock::StateLock(const std::filesystem::path &dir) {
         ::close(fd_);
         throw Failure(kExitLocal, "cannot lock the state directory " + dir.string() + ": " + std::strerror(err));
     }
+    refuse_if_kmd_serves(dir);
+}
+
+// A kmd keeps its TEE on the directory: a second TEE here would run
+// beside it on the same files. Checked with the lock held, so that a kmd
+// starting now waits for this run instead.
+void StateLock::refuse_if_kmd_serves(const std::filesystem::path &dir) {
+    std::optional<std::string> socket = km::kmd_serving(dir);
+    if (!socket)
+        return;
+    ::close(fd_);
+    if (socket->empty())
+        throw Failure(kExitLocal,
+                      "kmd serves the state directory " + dir.string() + ": run kmctl with --socket and kmd's socket");
+    throw Failure(kExitLocal, "kmd serves the state directory " + dir.string() + " on the socket " + *socket +
+                                  ": run kmctl with --socket " + *socket + " (or set KMCTL_SOCKET)");
 }
 
 StateLock::~StateLock() {
@@ -110,26 +125,47 @@ void add_global_options(CLI::App &app, GlobalOptions &options) {
            "Platform trace lines shown on stderr: none, error, info, debug or flow (default: error)")
         ->transform(CLI::IsMember({"none", "error", "info", "debug", "flow"}, CLI::ignore_case))
         ->type_name("LEVEL");
+    const char *socket = std::getenv("KMCTL_SOCKET");
+    options.socket = socket ? socket : "";
+    app.add_option_function<std::string>(
+           "--socket",
+           [&options](const std::string &path) {
+               if (path.empty())
+                   throw CLI::ValidationError("--socket", "the socket path must not be empty");
+               options.socket = path;
+           },
+           "Use the TEE of the kmd listening on this socket instead of one in this process (default: "
+           "$KMCTL_SOCKET; none: embedded). --state and --log-level are then kmd's.")
+        ->type_name("PATH");
 }
 
 std::filesystem::path default_state_dir() {
-    std::string explicit_dir = env("KMCTL_STATE");
-    if (!explicit_dir.empty())
-        return explicit_dir;
-    // A relative XDG_STATE_HOME is invalid and ignored.
-    std::string xdg = env("XDG_STATE_HOME");
-    if (!xdg.empty() && xdg[0] == '/')
-        return std::filesystem::path(xdg) / "kmctl";
-    std::string home = env("HOME");
-    if (!home.empty())
-        return std::filesystem::path(home) / ".local" / "state" / "kmctl";
-    throw Failure(kExitUsage, "no state directory: pass --state DIR or set KMCTL_STATE");
+    std::filesystem::path dir = km::default_state_dir();
+    if (dir.empty())
+        throw Failure(kExitUsage, "no state directory: pass --state DIR or set KMCTL_STATE");
+    return dir;
 }
 
+namespace {
+
+// The transport of a session: kmd's socket, or a TEE here on the locked directory.
+std::unique_ptr<km::Transport> make_transport(const GlobalOptions &options, std::filesystem::path *state_dir,
+                                              std::unique_ptr<StateLock> *lock) {
+    if (!options.socket.empty())
+        return std::make_unique<km::SocketTransport>(options.socket);
+    *state_dir = make_state_dir(options);
+    *lock = std::make_unique<StateLock>(*state_dir);
+    return std::make_unique<km::EmbeddedTee>(*state_dir, options.trace_level);
+}
+
+} // namespace
+
 Session::Session(const GlobalOptions &options)
-    : state_dir_(make_state_dir(options)), lock_(state_dir_),
-      tee_(std::make_unique<km::EmbeddedTee>(state_dir_, options.trace_level)), client_(*tee_) {
-    km::Status opened{tee_->open(), 0};
+    : transport_(make_transport(options, &state_dir_, &lock_)), client_(*transport_) {
+    km::Status opened{transport_->open(), 0};
+    if (opened.tee == TEE_ERROR_COMMUNICATION && !embedded())
+        throw Failure(kExitTeeFailure,
+                      static_cast<km::SocketTransport &>(*transport_).error() + " (" + km::describe(opened) + ")");
     check(opened);
 }
 

@@ -47,9 +47,10 @@ struct GlobalOptions {
     std::string state_dir;    // when state_given
     bool state_given = false; // otherwise default_state_dir()
     int trace_level = 1;      // the platform trace threshold, error (1) to flow (4)
+    std::string socket;       // kmd's socket, from --socket or $KMCTL_SOCKET; empty: the embedded TEE
 };
 
-// add_global_options - --state and --log-level on the top-level app.
+// add_global_options - --state, --socket and --log-level on the top-level app.
 void add_global_options(CLI::App &app, GlobalOptions &options);
 
 // default_state_dir - $KMCTL_STATE, else $XDG_STATE_HOME/kmctl, else
@@ -59,7 +60,8 @@ std::filesystem::path default_state_dir();
 // StateLock - an exclusive lock on the state directory, held by one
 // embedded TEE at a time, so that kmctl processes sharing a directory run
 // one after another. Waits for the lock, saying so on stderr after one
-// second. Throws Failure (local) when the lock file cannot be used.
+// second. Throws Failure (local) when the lock file cannot be used, or
+// when a kmd serves the directory (the message names its socket).
 class StateLock {
   public:
     explicit StateLock(const std::filesystem::path &dir);
@@ -68,23 +70,32 @@ class StateLock {
     StateLock &operator=(const StateLock &) = delete;
 
   private:
+    void refuse_if_kmd_serves(const std::filesystem::path &dir);
     int fd_ = -1;
 };
 
-// Session - the embedded TEE started on the state directory, which is
-// created when missing (saying so on stderr) and locked for the session's
-// life, with a session open and a client on it. Throws Failure: local when
-// the directory cannot be made or locked, TEE failure when the session
-// cannot be opened. One Session per process.
+// Session - a session to the Keymaster TA with a client on it. With a
+// socket, through the kmd listening there (no state directory, no lock,
+// no TEE here). Otherwise the embedded TEE started on the state directory,
+// which is created when missing (saying so on stderr) and locked for the
+// session's life. Throws Failure: local when the directory cannot be made
+// or locked, TEE failure when kmd cannot be reached or the session cannot
+// be opened. One Session per process.
 class Session {
   public:
     explicit Session(const GlobalOptions &options);
     km::Client &client() { return client_; }
+    // transport - for what the client has no call for (the fingerprint notification).
+    km::Transport &transport() { return *transport_; }
+    // embedded - whether the TEE runs in this process; state_dir() is its
+    // directory, empty through kmd.
+    bool embedded() const { return lock_ != nullptr; }
+    const std::filesystem::path &state_dir() const { return state_dir_; }
 
   private:
     std::filesystem::path state_dir_;
-    StateLock lock_;
-    std::unique_ptr<km::EmbeddedTee> tee_;
+    std::unique_ptr<StateLock> lock_;
+    std::unique_ptr<km::Transport> transport_;
     km::Client client_;
 };
 

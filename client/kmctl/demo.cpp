@@ -191,6 +191,8 @@ void walk(const std::string &keep) {
             throw Failure(kExitLocal, "cannot create " + keep + ": " + ec.message());
     }
     const fs::path state = dir / "state";
+    // The walk runs on a TEE of its own on a fresh directory, never on a kmd.
+    ::unsetenv("KMCTL_SOCKET");
     std::ofstream(dir / "message.txt") << "A message the TA signs, MACs and encrypts.\n";
     std::ofstream(dir / "tampered.txt") << "A message the TA signs, MACs and encrypts!\n";
     std::ofstream(dir / "challenge.txt") << "server-challenge-5f3a91c2";

@@ -14,7 +14,7 @@ Command add_soter(CLI::App &kmctl, const GlobalOptions &options);
 } // namespace kmctl
 
 int main(int argc, char **argv) {
-    CLI::App app("Drive the Keymaster TA on the embedded TEE.", "kmctl");
+    CLI::App app("Drive the Keymaster TA, on a TEE in this process or through kmd (--socket).", "kmctl");
     kmctl::GlobalOptions options;
     kmctl::add_global_options(app, options);
     app.set_version_flag("--version", "kmctl " KM_VERSION, "Print kmctl's version and exit");

@@ -4,6 +4,7 @@
  * the provisioning TA's store, and the SOTER commands 0xFF01 to 0xFF03.
  */
 #include <cstdio>
+#include <iostream>
 #include <memory>
 #include <optional>
 
@@ -155,17 +156,15 @@ void wipe_factory(tee_host::provisioning::FactoryData &d) {
         wipe(*v);
 }
 
-// The state directory of the running session's TEE.
-std::filesystem::path session_state_dir() {
-    return tee_host::Tee::current()->config().state_dir;
-}
-
 void provision(const GlobalOptions &options, const ProvisionOptions &o) {
     if (o.cpu_id.size() > kMaxCpuId)
         usage_error("--cpu-id: at most " + std::to_string(kMaxCpuId) + " bytes");
     Pkey key = o.attk.empty() ? Pkey() : read_attk(o.attk);
     Session session(options);
-    std::filesystem::path dir = session_state_dir();
+    // The factory store sits beside the TEE; kmd's is out of reach.
+    if (!session.embedded())
+        usage_error("soter provision is the factory step: run it without --socket, before kmd starts");
+    const std::filesystem::path dir = session.state_dir();
     if (!o.force && tee_host::provisioning::provisioned(dir))
         throw Failure(kExitRefused, "the device is already provisioned; --force replaces its SOTER material");
     if (!key)
@@ -257,6 +256,8 @@ void device_id(const GlobalOptions &options) {
 void notify_fid(const GlobalOptions &options, uint32_t fid) {
     Session session(options);
     report_fid(session.client(), fid);
+    if (session.embedded())
+        std::cerr << "kmctl: note: this TEE ends with this command; through kmd the fid stays for 3 seconds\n";
 }
 
 } // namespace
