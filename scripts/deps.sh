@@ -1,14 +1,26 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when any is missing.
+# With "aarch64", also what the aarch64 configuration needs: Debian's arm64
+# libraries through multiarch and qemu-aarch64 to run the tests.
 set -euo pipefail
-pkgs=(cmake ninja-build g++ pkg-config libssl-dev libgtest-dev libgmock-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev help2man clang-format openssl)
+# The normal configuration builds the TA for aarch64 too (g++-aarch64-linux-gnu)
+# and checks its stack with python3.
+pkgs=(cmake ninja-build g++ pkg-config libssl-dev libgtest-dev libgmock-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev help2man clang-format openssl
+      g++-aarch64-linux-gnu python3)
+SUDO=""; [ "$(id -u)" -ne 0 ] && SUDO=sudo
+if [ "${1:-}" = aarch64 ]; then
+  pkgs+=(qemu-user libssl-dev:arm64 libgtest-dev:arm64 libgmock-dev:arm64)
+  if ! dpkg --print-foreign-architectures | grep -qx arm64; then
+    echo "Adding the arm64 architecture"
+    $SUDO dpkg --add-architecture arm64
+  fi
+fi
 missing=()
 for p in "${pkgs[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
 done
 if [ ${#missing[@]} -gt 0 ]; then
   echo "Installing: ${missing[*]}"
-  SUDO=""; [ "$(id -u)" -ne 0 ] && SUDO=sudo
   $SUDO apt-get update -qq
   DEBIAN_FRONTEND=noninteractive $SUDO apt-get install -y -qq "${missing[@]}"
 fi

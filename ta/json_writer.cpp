@@ -296,10 +296,19 @@ bool render_doc(sink *out, const json_doc *doc) {
     return !out->failed;
 }
 
+// Whether two NUL-terminated names are the same (no strcmp in a TEE's C library).
+bool same_name(const char *a, const char *b) {
+    while (*a && *a == *b) {
+        ++a;
+        ++b;
+    }
+    return *a == *b;
+}
+
 // Finds the member or appends a new one named name; null when full or out of memory.
 json_member_t *member_for(json_doc *doc, const char *name, uint32_t name_len) {
     for (uint32_t i = 0; i < doc->count; ++i)
-        if (!std::strcmp(doc->members[i].name, name))
+        if (same_name(doc->members[i].name, name))
             return &doc->members[i];
     if (doc->count == doc->capacity) {
         if (doc->capacity >= kJsonMaxMembers)

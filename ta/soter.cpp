@@ -521,7 +521,9 @@ char *produce_soter_sign_json(uint64_t uid, const uint8_t *message, uint32_t mes
         KM_ERR("json error root_value %p root_object %p\n", static_cast<void *>(doc.doc), static_cast<void *>(doc.doc));
         return nullptr;
     }
-    const uint32_t text_len = static_cast<uint32_t>(strnlen(reinterpret_cast<const char *>(message), message_len));
+    uint32_t text_len = 0; // up to the first NUL byte (no strnlen in a TEE's C library)
+    while (text_len < message_len && message[text_len] != 0)
+        ++text_len;
     if (!utf8_is_valid(message, message_len) || text_len != message_len) {
         KM_ERR("Not a valid utf8 string, strlen(raw) %d length %d", static_cast<int>(text_len),
                static_cast<int>(message_len));
