@@ -7,6 +7,9 @@ set -euo pipefail
 # and checks its stack with python3.
 pkgs=(cmake ninja-build g++ pkg-config libssl-dev libgtest-dev libgmock-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev help2man clang-format openssl
       g++-aarch64-linux-gnu python3)
+# The fuzz harnesses (scripts/fuzz.sh): clang 14, its sanitizer and libFuzzer
+# runtimes, and llvm-symbolizer for their reports.
+pkgs+=(clang-14 libclang-rt-14-dev llvm-14)
 SUDO=""; [ "$(id -u)" -ne 0 ] && SUDO=sudo
 if [ "${1:-}" = aarch64 ]; then
   pkgs+=(qemu-user libssl-dev:arm64 libgtest-dev:arm64 libgmock-dev:arm64)

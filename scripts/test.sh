@@ -24,3 +24,16 @@ for kind in normal asan aarch64; do
     python3 "$root/scripts/stack_budget.py" --table "$root/scripts/stack_budget.table" "$root/build/normal/ta/ta_aarch64"
   fi
 done
+# Each fuzz harness a few seconds on its corpus (seeds and regression
+# inputs): a smoke run; scripts/fuzz.sh TARGET SECONDS runs one for long.
+echo "== fuzz smoke runs =="
+for target in $("$root/scripts/fuzz.sh" --list); do
+  log="$root/build/fuzz/smoke-$target.log"
+  mkdir -p "$root/build/fuzz"
+  if ! "$root/scripts/fuzz.sh" "$target" "${KM_FUZZ_SMOKE_SECONDS:-10}" >"$log" 2>&1; then
+    tail -n 60 "$log"
+    echo "fuzz smoke run of $target failed (whole log: $log)" >&2
+    exit 1
+  fi
+  grep -E '^stat::number_of_executed_units' "$log" | sed "s/^/$target: /"
+done

@@ -224,7 +224,11 @@ uint32_t rate_limit_last_use(const uint8_t *key_id, uint32_t key_id_len, TEE_Tim
     if (!resolve_key_id(key_id, key_id_len, &ref))
         return kRateLimitUnknown;
     const use_log_entry_t *e = find_entry(ref);
-    if (!e)
+    // An entry made by the use count alone was never stamped: the key has
+    // no last use yet, and its first use is not "too soon" after boot.
+    const bool stamped =
+        e && (e->last_use.seconds || e->last_use.millis || e->rate_limit_end.seconds || e->rate_limit_end.millis);
+    if (!stamped)
         return 1;
     *last_use = e->last_use;
     return 0;

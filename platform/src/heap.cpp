@@ -12,8 +12,33 @@
 
 #include "platform_internal.h"
 
+// Sanitizer builds poison each block's spare byte, so a one-byte overrun
+// of a TA block is reported where it happens.
+#if defined(__SANITIZE_ADDRESS__)
+#define KM_HEAP_ASAN 1
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer)
+#define KM_HEAP_ASAN 1
+#endif
+#endif
+#ifdef KM_HEAP_ASAN
+#include <sanitizer/asan_interface.h>
+#endif
+
 namespace tee_host {
 namespace {
+
+// poison_spare, unpoison_spare - the byte after a block's size bytes.
+void poison_spare([[maybe_unused]] void *p, [[maybe_unused]] size_t size) {
+#ifdef KM_HEAP_ASAN
+    ASAN_POISON_MEMORY_REGION(static_cast<char *>(p) + size, 1);
+#endif
+}
+void unpoison_spare([[maybe_unused]] void *p, [[maybe_unused]] size_t size) {
+#ifdef KM_HEAP_ASAN
+    ASAN_UNPOISON_MEMORY_REGION(static_cast<char *>(p) + size, 1);
+#endif
+}
 
 struct Block {
     const void *owner; // the TA whose call allocated it, null outside TA calls
@@ -65,6 +90,7 @@ void *allocate(uint32_t size, uint32_t hint, const char *file, int line) {
         std::memset(p, 0xA5, size_t{size} + 1); // make reliance on zeroes visible
     else
         std::memset(p, 0, size_t{size} + 1);
+    poison_spare(p, size);
     s.blocks[p] = Block{detail::current_ta(), size, file ? file : "?", line, ++s.seq};
     s.live_bytes += size;
     if (s.live_bytes > s.peak_bytes)
@@ -87,8 +113,10 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
     if (!p)
         return nullptr;
     std::memset(p, 0, size_t{new_size} + 1);
+    poison_spare(p, new_size);
     std::memcpy(p, buffer, old.size < new_size ? old.size : new_size);
     std::memset(buffer, 0, old.size); // old contents may be secret
+    unpoison_spare(buffer, old.size);
     std::free(buffer);
     s.blocks.erase(it);
     s.blocks[p] = Block{old.owner, new_size, file ? file : old.file, file ? line : old.line, ++s.seq};
@@ -150,6 +178,7 @@ void heap_reset(size_t limit) {
     std::lock_guard<std::mutex> lock(s.mu);
     for (auto &[p, b] : s.blocks) {
         std::memset(p, 0, b.size);
+        unpoison_spare(p, b.size);
         std::free(p);
     }
     s.blocks.clear();
@@ -175,6 +204,7 @@ void heap_instance_ended(const void *owner) {
         leaks.push_back({b.seq, heap::Allocation{b.size, b.file, b.line}});
         // A real TEE reclaims the whole instance heap; so do we, after reporting.
         std::memset(it->first, 0, b.size);
+        unpoison_spare(it->first, b.size);
         std::free(it->first);
         s.live_bytes -= b.size;
         it = s.blocks.erase(it);
@@ -219,6 +249,7 @@ void TEE_Free(void *buffer) {
     if (it == s.blocks.end())
         detail::panic("TEE_Free of a pointer the heap did not hand out");
     s.live_bytes -= it->second.size;
+    unpoison_spare(buffer, it->second.size);
     s.blocks.erase(it);
     std::free(buffer);
 }

@@ -80,8 +80,9 @@ uint32_t rate_limit_record(const uint8_t *key_id, uint32_t key_id_len, uint32_t 
 /* rate_limit_last_use's answer when the key could not be identified: the caller must refuse. */
 constexpr uint32_t kRateLimitUnknown = 2;
 /*
- * rate_limit_last_use - 0 and *last_use when the key has an entry, 1 when
- * it has none, kRateLimitUnknown when its identifier could not be computed.
+ * rate_limit_last_use - 0 and *last_use when the key's use was stamped, 1
+ * when it never was (no entry, or only a use count), kRateLimitUnknown when
+ * its identifier could not be computed.
  */
 uint32_t rate_limit_last_use(const uint8_t *key_id, uint32_t key_id_len, TEE_Time *last_use);
 /* get_wall_time - the REE time at start advanced by the TEE system time elapsed since. */

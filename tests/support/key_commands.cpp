@@ -7,7 +7,6 @@
 #include <cstring>
 
 #include <openssl/evp.h>
-#include <openssl/hmac.h>
 
 #include "keymaster_defs.h"
 #include "km/key_material.h"
@@ -38,14 +37,6 @@ Bytes rsa_material(const char *pem) {
                                      &why);
     EXPECT_TRUE(m.has_value()) << why;
     return m.value_or(Bytes{});
-}
-
-Bytes key_reference(const Bytes &blob, const Bytes &app_id, const Bytes &app_data) {
-    Bytes out;
-    km::put_lv(out, blob);
-    km::put_lv(out, app_id);
-    km::put_lv(out, app_data);
-    return out;
 }
 
 namespace {
@@ -214,20 +205,9 @@ void KeyTest::restart_instance() {
 
 Bytes KeyTest::mint_token(uint64_t challenge, uint64_t user_id, uint64_t authenticator_id, uint32_t auth_type,
                           uint64_t timestamp_ms, uint8_t version) {
-    Bytes t(69, 0);
-    t[0] = version;
-    for (int i = 0; i < 8; ++i) {
-        t[1 + i] = static_cast<uint8_t>(challenge >> (8 * i));
-        t[9 + i] = static_cast<uint8_t>(user_id >> (8 * i));
-        t[17 + i] = static_cast<uint8_t>(authenticator_id >> (8 * i));
-        t[29 + i] = static_cast<uint8_t>(timestamp_ms >> (8 * (7 - i)));
-    }
-    for (int i = 0; i < 4; ++i)
-        t[25 + i] = static_cast<uint8_t>(auth_type >> (8 * (3 - i)));
-    Bytes seed = tee_->boot_seed();
-    unsigned int len = 0;
-    HMAC(EVP_sha256(), seed.data(), static_cast<int>(seed.size()), t.data(), 37, t.data() + 37, &len);
-    EXPECT_EQ(len, 32u);
+    Bytes t =
+        mint_auth_token(tee_->boot_seed(), {challenge, user_id, authenticator_id, auth_type, timestamp_ms, version});
+    EXPECT_EQ(t.size(), 69u);
     return t;
 }
 

@@ -16,9 +16,6 @@ const evp_md_st *md_for(uint32_t digest);
 // by the client library (a test failure and empty when it does not decode).
 Bytes rsa_material(const char *pem);
 
-// The three-field key reference of the characteristics and export commands.
-Bytes key_reference(const Bytes &blob, const Bytes &app_id = {}, const Bytes &app_data = {});
-
 class KeyTest : public TaTest {
   protected:
     // generate - command 13; *blob is resized to what the TA wrote.

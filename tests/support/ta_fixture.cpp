@@ -8,32 +8,6 @@
 
 #include "ta_entry.h"
 
-Params Params::value(uint32_t a, uint32_t b) {
-    Params r;
-    r.types = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, 0, 0, 0);
-    r.p[0].value.a = a;
-    r.p[0].value.b = b;
-    return r;
-}
-
-Params Params::io(uint32_t a, uint32_t b, Bytes *in, Bytes *out) {
-    Params r = value(a, b);
-    uint32_t t1 = TEE_PARAM_TYPE_NONE;
-    uint32_t t2 = TEE_PARAM_TYPE_NONE;
-    if (in) {
-        t1 = TEE_PARAM_TYPE_MEMREF_INPUT;
-        r.p[1].memref.buffer = in->data();
-        r.p[1].memref.size = static_cast<uint32_t>(in->size());
-    }
-    if (out) {
-        t2 = TEE_PARAM_TYPE_MEMREF_OUTPUT;
-        r.p[2].memref.buffer = out->data();
-        r.p[2].memref.size = static_cast<uint32_t>(out->size());
-    }
-    r.types = TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, t1, t2, 0);
-    return r;
-}
-
 void TeeTest::SetUp() {
     char tmpl[] = "/tmp/tee-test-XXXXXX";
     ASSERT_NE(mkdtemp(tmpl), nullptr);
@@ -131,12 +105,6 @@ std::string TaTest::dump_log() const {
     return s;
 }
 
-std::ostream &operator<<(std::ostream &os, const Outcome &o) {
-    char buf[48];
-    std::snprintf(buf, sizeof buf, "{0x%08x, %d}", static_cast<unsigned>(o.res), static_cast<int>(o.error));
-    return os << buf;
-}
-
 int sweep_allocations(const std::string &what, const std::function<void()> &setup, const std::function<Outcome()> &step,
                       const std::vector<Outcome> &allowed, const std::function<void()> &cleanup) {
     const size_t base = tee_host::heap::stats().live_count;
@@ -184,14 +152,4 @@ Bytes hex(std::string_view s) {
         }
     }
     return out;
-}
-
-std::string to_hex(const uint8_t *p, size_t n) {
-    static const char digits[] = "0123456789abcdef";
-    std::string s;
-    for (size_t i = 0; i < n; ++i) {
-        s += digits[p[i] >> 4];
-        s += digits[p[i] & 15];
-    }
-    return s;
 }

@@ -1,7 +1,7 @@
 /*
  * ta_fixture.h - a live emulated TEE with the Keymaster TA installed, a
- * normal-world session open and the trace captured; and helpers to drive
- * commands with real TEE_Param arrays.
+ * normal-world session open and the trace captured. Commands are driven
+ * with the real TEE_Param arrays of ta_calls.h.
  */
 #ifndef TA_FIXTURE_H
 #define TA_FIXTURE_H
@@ -16,19 +16,8 @@
 
 #include <gtest/gtest.h>
 
+#include "ta_calls.h"
 #include "tee_host.h"
-
-using Bytes = std::vector<uint8_t>;
-
-// A command's parameters as the normal world would pass them.
-struct Params {
-    uint32_t types = 0;
-    TEE_Param p[4] = {};
-
-    static Params value(uint32_t a = 0, uint32_t b = 0);
-    // value in params[0], optional input in params[1], output capacity in params[2].
-    static Params io(uint32_t a, uint32_t b, Bytes *in, Bytes *out);
-};
 
 // A bare emulated TEE with no TA installed, on a fresh state directory,
 // for tests of the platform's own services. Ends with no live handle.
@@ -71,15 +60,6 @@ class TaTest : public ::testing::Test {
     uint32_t session_ = 0;
 };
 
-// A command's two result channels: the TEE result and the Keymaster error in a.
-struct Outcome {
-    TEE_Result res;
-    int32_t error;
-    bool ok() const { return res == TEE_SUCCESS && error == 0; }
-    bool operator==(const Outcome &o) const { return res == o.res && error == o.error; }
-};
-std::ostream &operator<<(std::ostream &os, const Outcome &o);
-
 // sweep_allocations - fails the 1st, 2nd, ... TA heap allocation of `step`
 // in turn (after `setup`, which may be null) until a run fires no failure.
 // Every run whose failure fired must end in one of `allowed`, and with as
@@ -91,9 +71,5 @@ int sweep_allocations(const std::string &what, const std::function<void()> &setu
                       const std::vector<Outcome> &allowed, const std::function<void()> &cleanup = nullptr);
 
 Bytes hex(std::string_view s);
-std::string to_hex(const uint8_t *p, size_t n);
-inline std::string to_hex(const Bytes &b) {
-    return to_hex(b.data(), b.size());
-}
 
 #endif
