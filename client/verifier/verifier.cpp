@@ -236,7 +236,9 @@ const char *kind_text(Kind kind) {
 
 // check_members - every member known and of its type, every required one there.
 bool check_members(const json &doc, std::span<const MemberRule> rules, Verdict &v) {
-    for (const auto &[name, value] : doc.items()) {
+    for (const auto &item : doc.items()) {
+        const std::string &name = item.key();
+        const json &value = item.value();
         auto rule = std::find_if(rules.begin(), rules.end(), [&](const MemberRule &r) { return r.name == name; });
         if (rule == rules.end())
             return refuse(v, Check::members, "the document has an unknown member \"" + name + "\"");
