@@ -5,6 +5,7 @@
 #include "key_store.h"
 
 #include "byte_io.h"
+#include "key_cache.h"
 #include "marshal.h"
 #include "ta_log.h"
 #include "tee_guard.h"
@@ -202,7 +203,12 @@ TEE_Result key_store_init() {
     } else {
         KM_INFO("no RPMB for ksk\n");
     }
-    return TEE_SUCCESS;
+    res = key_cache_init();
+    if (res != TEE_SUCCESS) {
+        KM_ERR("Out of memory");
+        key_store_deinit();
+    }
+    return res;
 }
 
 void key_store_deinit() {
@@ -218,6 +224,7 @@ void key_store_deinit() {
         TEE_FreeOperation(rpmb_ksk_mac);
     derived_ksk_mac = nullptr;
     rpmb_ksk_mac = nullptr;
+    key_cache_deinit();
 }
 
 TEE_Result TEE_DeriveKK(TEE_ObjectHandle ksk, const uint8_t *input, TEE_ObjectHandle *kk) {
@@ -368,6 +375,50 @@ TEE_Result start_blob_decryption(const uint8_t *blob, operation_guard *op, bool 
 
 } // namespace
 
+namespace {
+
+// decrypt_blob - the authenticated plaintext of a blob (longer than its
+// header) into *plain; TEE errors as the TEE gave them, *error -33 for a
+// protection byte naming no KSK.
+TEE_Result decrypt_blob(const uint8_t *blob, uint32_t blob_len, heap_buf *plain, int32_t *error,
+                        const char *func = __builtin_FUNCTION()) {
+    operation_guard op;
+    bool unknown = false;
+    TEE_Result res = start_blob_decryption(blob, &op, &unknown, func);
+    if (res != TEE_SUCCESS)
+        return res;
+    if (unknown) {
+        *error = KM_ERROR_INVALID_KEY_BLOB;
+        return TEE_SUCCESS;
+    }
+    const uint32_t plain_len = blob_len - kBlobHeaderSize;
+    if (!plain->alloc(plain_len)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
+        return TEE_SUCCESS;
+    }
+    uint32_t first = plain_len;
+    res = TEE_AEUpdate(op.get(), blob + kBlobHeaderSize, plain_len, plain->get(), &first);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AEUpdate failed with 0x%08x\n", res);
+        return res;
+    }
+    uint32_t rest = plain_len - first;
+    res = TEE_AEDecryptFinal(op.get(), nullptr, 0, plain->get() + first, &rest, blob + kBlobTagOffset, kBlobTagSize);
+    if (res != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AEDecryptFinal failed with 0x%08x\n", res);
+        return res;
+    }
+    if (first + rest != plain_len) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Too short output of AES, expect %dB, got %dB",
+                    static_cast<int>(plain_len), static_cast<int>(first + rest));
+        *error = KM_ERROR_UNKNOWN_ERROR;
+    }
+    return TEE_SUCCESS;
+}
+
+} // namespace
+
 TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, uint32_t *key_data_len,
                     keymaster_key_param_set_t *params, int32_t *error) {
     *key_data = nullptr;
@@ -380,43 +431,21 @@ TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, 
         *error = KM_ERROR_INVALID_KEY_BLOB;
         return TEE_SUCCESS;
     }
-    operation_guard op;
-    bool unknown = false;
-    TEE_Result res = start_blob_decryption(blob, &op, &unknown);
-    if (res != TEE_SUCCESS)
-        return res;
-    if (unknown) {
-        *error = KM_ERROR_INVALID_KEY_BLOB;
-        return TEE_SUCCESS;
-    }
-
-    const uint32_t plain_len = blob_len - kBlobHeaderSize;
+    // A blob equal in every byte to one opened before needs no derivation
+    // and no decryption: its plaintext was authenticated then.
     heap_buf plain(true);
-    if (!plain.alloc(plain_len)) {
-        KM_ERR("Out of memory");
-        *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-        return TEE_SUCCESS;
-    }
-    uint32_t first = plain_len;
-    res = TEE_AEUpdate(op.get(), blob + kBlobHeaderSize, plain_len, plain.get(), &first);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AEUpdate failed with 0x%08x\n", res);
-        return res;
-    }
-    uint32_t rest = plain_len - first;
-    res = TEE_AEDecryptFinal(op.get(), nullptr, 0, plain.get() + first, &rest, blob + kBlobTagOffset, kBlobTagSize);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AEDecryptFinal failed with 0x%08x\n", res);
-        return res;
-    }
-    if (first + rest != plain_len) {
-        KM_ERR("Too short output of AES, expect %dB, got %dB", static_cast<int>(plain_len),
-               static_cast<int>(first + rest));
-        *error = KM_ERROR_UNKNOWN_ERROR;
-        return TEE_SUCCESS;
+    const uint8_t *text = nullptr;
+    uint32_t text_len = 0;
+    const bool cached = key_cache_find(blob, blob_len, &text, &text_len);
+    if (!cached) {
+        TEE_Result res = decrypt_blob(blob, blob_len, &plain, error);
+        if (res != TEE_SUCCESS || *error)
+            return res;
+        text = plain.get();
+        text_len = plain.len();
     }
 
-    byte_reader in(plain.get(), plain_len);
+    byte_reader in(text, text_len);
     const uint8_t *kd = nullptr;
     uint32_t kd_len = 0;
     const uint8_t *ser = nullptr;
@@ -437,6 +466,8 @@ TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, 
         *error = KM_ERROR_INVALID_ARGUMENT;
         return TEE_SUCCESS;
     }
+    if (!cached)
+        key_cache_put(blob, blob_len, text, text_len);
     *key_data_len = data.len();
     *key_data = data.release();
     *error = KM_ERROR_OK;
@@ -469,11 +500,14 @@ TEE_Result open_key_raw(uint8_t *buf, uint32_t *len) {
     return TEE_SUCCESS;
 }
 
-TEE_Result key_store_delete_key(const uint8_t *, uint32_t blob_len, int32_t *error) {
+TEE_Result key_store_delete_key(const uint8_t *blob, uint32_t blob_len, int32_t *error) {
     *error = blob_len < 2 ? KM_ERROR_INVALID_KEY_BLOB : KM_ERROR_OK;
+    // The blob stays valid (nothing is stored per key), but its opened copy goes.
+    key_cache_forget(blob, blob_len);
     return TEE_SUCCESS;
 }
 
 TEE_Result key_store_delete_all_keys() {
+    key_cache_clear();
     return TEE_SUCCESS;
 }

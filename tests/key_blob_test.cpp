@@ -4,6 +4,7 @@
  * damaged stored KSK, and the raw opening for trusted TAs.
  */
 #include <cstring>
+#include <vector>
 
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
@@ -147,6 +148,74 @@ TEST_F(KeyBlob, LengthBoundaries) {
     Bytes longer = blob;
     longer.push_back(0);
     EXPECT_EQ(describe(longer).res, TEE_ERROR_MAC_INVALID);
+}
+
+// TA heap allocations a command makes: opening a blob already opened
+// skips its decryption buffer, so a cached open makes fewer.
+template <typename F> uint64_t allocations_of(F f) {
+    const uint64_t before = tee_host::heap::stats().allocations;
+    f();
+    return tee_host::heap::stats().allocations - before;
+}
+
+TEST_F(KeyBlob, AnOpenedBlobIsReusedOnlyForTheSameBytes) {
+    Bytes blob = make_blob();
+    const uint64_t cold = allocations_of([&] { ASSERT_TRUE(describe(blob).ok()); });
+    const uint64_t warm = allocations_of([&] { ASSERT_TRUE(describe(blob).ok()); });
+    EXPECT_LT(warm, cold) << "the second open of the same blob should not decrypt it again";
+
+    // With the blob cached, no changed, shorter or longer blob opens.
+    for (size_t i = 1; i < blob.size(); ++i) {
+        Bytes bad = blob;
+        bad[i] ^= 0x80;
+        EXPECT_EQ(describe(bad).res, TEE_ERROR_MAC_INVALID) << "byte " << i;
+    }
+    Bytes other_ksk = blob;
+    other_ksk[0] ^= 0x01;
+    EXPECT_EQ(describe(other_ksk).res, TEE_ERROR_MAC_INVALID);
+    EXPECT_EQ(describe(Bytes(blob.begin(), blob.end() - 1)).res, TEE_ERROR_MAC_INVALID);
+    Bytes longer = blob;
+    longer.push_back(0);
+    EXPECT_EQ(describe(longer).res, TEE_ERROR_MAC_INVALID);
+    EXPECT_TRUE(describe(blob).ok());
+
+    // A hit answers exactly as the first open did.
+    Bytes first, again;
+    ASSERT_TRUE(characteristics(key_reference(blob), &first).ok());
+    ASSERT_TRUE(characteristics(key_reference(blob), &again).ok());
+    EXPECT_EQ(first, again);
+}
+
+TEST_F(KeyBlob, OpenedBlobsAreForgottenOnEvictionDeletionAndRestart) {
+    std::vector<Bytes> blobs;
+    for (uint8_t i = 0; i < 9; ++i)
+        blobs.push_back(make_blob(Bytes(32, static_cast<uint8_t>(0x10 + i))));
+    const uint64_t cold = allocations_of([&] { ASSERT_TRUE(describe(blobs[0]).ok()); });
+    const uint64_t warm = allocations_of([&] { ASSERT_TRUE(describe(blobs[0]).ok()); });
+    ASSERT_LT(warm, cold);
+    auto is_warm = [&](const Bytes &b) {
+        const uint64_t n = allocations_of([&] { EXPECT_TRUE(describe(b).ok()); });
+        return n == warm;
+    };
+
+    // Eight keys fit; a ninth evicts the least recently used.
+    for (size_t i = 1; i < 9; ++i)
+        describe(blobs[i]);
+    EXPECT_FALSE(is_warm(blobs[0])) << "the least recently used blob should have been evicted";
+    EXPECT_TRUE(is_warm(blobs[8]));
+
+    EXPECT_TRUE(delete_key(blobs[8]).ok());
+    EXPECT_FALSE(is_warm(blobs[8])) << "a deleted key's opened copy should be gone";
+    EXPECT_TRUE(is_warm(blobs[8]));
+
+    EXPECT_TRUE(delete_all().ok());
+    for (size_t i = 6; i < 9; ++i)
+        EXPECT_FALSE(is_warm(blobs[i])) << "delete-all should forget key " << i;
+
+    restart_instance();
+    EXPECT_FALSE(is_warm(blobs[8])) << "a new instance starts with nothing opened";
+    EXPECT_TRUE(is_warm(blobs[8]));
+    EXPECT_EQ(extra_allocations(), 0u);
 }
 
 TEST_F(KeyBlob, BlobSizeIsExactAndCapacityIsChecked) {

@@ -515,6 +515,15 @@ TEST_F(Rsa, InconsistentComponentsAreRefusedAndLeaveTheObjectEmpty) {
         with(TEE_ATTR_RSA_EXPONENT2, flip_low_bit),                 // dq != d mod (q-1)
         with(TEE_ATTR_RSA_COEFFICIENT, flip_low_bit),               // qinv q != 1 mod p
     };
+    // The good key prepared first: a key seen before skips the CRT check,
+    // which must never let a variant of it through.
+    {
+        Obj good(TEE_TYPE_RSA_KEYPAIR, 1024, key.pair());
+        Op s(TEE_ALG_RSASSA_PKCS1_V1_5_SHA256, TEE_MODE_SIGN, 1024, good);
+        Bytes sig;
+        ASSERT_EQ(sign(s, Bytes(32, 7), &sig), TEE_SUCCESS);
+        ASSERT_EQ(tee_host::rsa_cache::stats().size, 1u);
+    }
     for (size_t i = 0; i < std::size(bad); ++i) {
         Obj o(TEE_TYPE_RSA_KEYPAIR, 1024);
         EXPECT_EQ(o.populate(bad[i]), TEE_ERROR_BAD_PARAMETERS) << "case " << i;

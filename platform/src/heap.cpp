@@ -7,8 +7,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <map>
 #include <mutex>
+#include <vector>
 
 #include "platform_internal.h"
 
@@ -48,9 +48,94 @@ struct Block {
     uint64_t seq;
 };
 
+// BlockTable - the live blocks by address: open addressing with linear
+// probing, so that recording a block costs no allocation of its own (a
+// node-based map doubled the work of every TA allocation).
+class BlockTable {
+  public:
+    size_t size() const { return live_; }
+
+    Block *find(void *p) {
+        if (slots_.empty())
+            return nullptr;
+        for (size_t i = index(p);; i = (i + 1) & mask()) {
+            Slot &s = slots_[i];
+            if (s.p == p)
+                return &s.b;
+            if (!s.p)
+                return nullptr;
+        }
+    }
+
+    void insert(void *p, const Block &b) {
+        if ((used_ + 1) * 2 > slots_.size())
+            rehash(live_ * 4 > slots_.size() ? slots_.size() * 2 : std::max<size_t>(slots_.size(), 1024));
+        for (size_t i = index(p);; i = (i + 1) & mask()) {
+            Slot &s = slots_[i];
+            if (!s.p || s.p == tombstone()) {
+                used_ += s.p ? 0 : 1;
+                s = Slot{p, b};
+                ++live_;
+                return;
+            }
+        }
+    }
+
+    // erase - p must be present (find first).
+    void erase(void *p) {
+        for (size_t i = index(p);; i = (i + 1) & mask()) {
+            if (slots_[i].p == p) {
+                slots_[i].p = tombstone();
+                --live_;
+                return;
+            }
+        }
+    }
+
+    // for_each - f(p, block) for every live block; f returns whether to drop it.
+    template <typename F> void for_each(F f) {
+        for (Slot &s : slots_) {
+            if (s.p && s.p != tombstone() && f(s.p, s.b)) {
+                s.p = tombstone();
+                --live_;
+            }
+        }
+    }
+
+    void clear() {
+        slots_.clear();
+        live_ = used_ = 0;
+    }
+
+  private:
+    struct Slot {
+        void *p = nullptr; // null: never used; tombstone(): freed
+        Block b{};
+    };
+    static void *tombstone() { return reinterpret_cast<void *>(uintptr_t{1}); }
+    size_t mask() const { return slots_.size() - 1; }
+    size_t index(void *p) const {
+        return static_cast<size_t>((reinterpret_cast<uintptr_t>(p) >> 4) * 0x9E3779B97F4A7C15ull) & mask();
+    }
+    void rehash(size_t capacity) {
+        std::vector<Slot> old;
+        old.swap(slots_);
+        slots_.resize(capacity);
+        live_ = used_ = 0;
+        for (const Slot &s : old) {
+            if (s.p && s.p != tombstone())
+                insert(s.p, s.b);
+        }
+    }
+
+    std::vector<Slot> slots_;
+    size_t live_ = 0;
+    size_t used_ = 0; // live blocks and tombstones
+};
+
 struct HeapState {
     std::mutex mu;
-    std::map<void *, Block> blocks;
+    BlockTable blocks;
     size_t live_bytes = 0;
     size_t peak_bytes = 0;
     size_t limit = 0x80000;
@@ -91,7 +176,7 @@ void *allocate(uint32_t size, uint32_t hint, const char *file, int line) {
     else
         std::memset(p, 0, size_t{size} + 1);
     poison_spare(p, size);
-    s.blocks[p] = Block{detail::current_ta(), size, file ? file : "?", line, ++s.seq};
+    s.blocks.insert(p, Block{detail::current_ta(), size, file ? file : "?", line, ++s.seq});
     s.live_bytes += size;
     if (s.live_bytes > s.peak_bytes)
         s.peak_bytes = s.live_bytes;
@@ -103,10 +188,10 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
         return allocate(new_size, TEE_MALLOC_FILL_ZERO, file, line);
     HeapState &s = state();
     std::lock_guard<std::mutex> lock(s.mu);
-    auto it = s.blocks.find(buffer);
-    if (it == s.blocks.end())
+    const Block *found = s.blocks.find(buffer);
+    if (!found)
         detail::panic("TEE_Realloc of a pointer the heap did not hand out");
-    Block old = it->second;
+    const Block old = *found;
     if (refuse(s, old.size, new_size))
         return nullptr; // the old block stays valid
     void *p = std::malloc(size_t{new_size} + 1);
@@ -118,8 +203,8 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
     std::memset(buffer, 0, old.size); // old contents may be secret
     unpoison_spare(buffer, old.size);
     std::free(buffer);
-    s.blocks.erase(it);
-    s.blocks[p] = Block{old.owner, new_size, file ? file : old.file, file ? line : old.line, ++s.seq};
+    s.blocks.erase(buffer);
+    s.blocks.insert(p, Block{old.owner, new_size, file ? file : old.file, file ? line : old.line, ++s.seq});
     s.live_bytes = s.live_bytes - old.size + new_size;
     if (s.live_bytes > s.peak_bytes)
         s.peak_bytes = s.live_bytes;
@@ -128,8 +213,10 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
 
 std::vector<heap::Allocation> live_locked(HeapState &s) {
     std::vector<std::pair<uint64_t, heap::Allocation>> v;
-    for (const auto &[p, b] : s.blocks)
+    s.blocks.for_each([&](void *, const Block &b) {
         v.push_back({b.seq, heap::Allocation{b.size, b.file, b.line}});
+        return false;
+    });
     std::sort(v.begin(), v.end(), [](const auto &x, const auto &y) { return x.first < y.first; });
     std::vector<heap::Allocation> out;
     for (auto &e : v)
@@ -176,11 +263,12 @@ namespace detail {
 void heap_reset(size_t limit) {
     HeapState &s = state();
     std::lock_guard<std::mutex> lock(s.mu);
-    for (auto &[p, b] : s.blocks) {
+    s.blocks.for_each([](void *p, const Block &b) {
         std::memset(p, 0, b.size);
         unpoison_spare(p, b.size);
         std::free(p);
-    }
+        return true;
+    });
     s.blocks.clear();
     s.live_bytes = 0;
     s.peak_bytes = 0;
@@ -195,20 +283,17 @@ void heap_instance_ended(const void *owner) {
     HeapState &s = state();
     std::lock_guard<std::mutex> lock(s.mu);
     std::vector<std::pair<uint64_t, heap::Allocation>> leaks;
-    for (auto it = s.blocks.begin(); it != s.blocks.end();) {
-        if (it->second.owner != owner) {
-            ++it;
-            continue;
-        }
-        const Block &b = it->second;
+    s.blocks.for_each([&](void *p, const Block &b) {
+        if (b.owner != owner)
+            return false;
         leaks.push_back({b.seq, heap::Allocation{b.size, b.file, b.line}});
         // A real TEE reclaims the whole instance heap; so do we, after reporting.
-        std::memset(it->first, 0, b.size);
-        unpoison_spare(it->first, b.size);
-        std::free(it->first);
+        std::memset(p, 0, b.size);
+        unpoison_spare(p, b.size);
+        std::free(p);
         s.live_bytes -= b.size;
-        it = s.blocks.erase(it);
-    }
+        return true;
+    });
     std::sort(leaks.begin(), leaks.end(), [](const auto &x, const auto &y) { return x.first < y.first; });
     s.last_leaks.clear();
     for (auto &l : leaks) {
@@ -245,12 +330,12 @@ void TEE_Free(void *buffer) {
         return;
     HeapState &s = state();
     std::lock_guard<std::mutex> lock(s.mu);
-    auto it = s.blocks.find(buffer);
-    if (it == s.blocks.end())
+    const Block *found = s.blocks.find(buffer);
+    if (!found)
         detail::panic("TEE_Free of a pointer the heap did not hand out");
-    s.live_bytes -= it->second.size;
-    unpoison_spare(buffer, it->second.size);
-    s.blocks.erase(it);
+    s.live_bytes -= found->size;
+    unpoison_spare(buffer, found->size);
+    s.blocks.erase(buffer);
     std::free(buffer);
 }
 
