@@ -438,9 +438,14 @@ TEE_Result open_key(const uint8_t *blob, uint32_t blob_len, uint8_t **key_data, 
     uint32_t text_len = 0;
     const bool cached = key_cache_find(blob, blob_len, &text, &text_len);
     if (!cached) {
-        TEE_Result res = decrypt_blob(blob, blob_len, &plain, error);
-        if (res != TEE_SUCCESS || *error)
+        int32_t decrypt_error = KM_ERROR_OK;
+        TEE_Result res = decrypt_blob(blob, blob_len, &plain, &decrypt_error);
+        if (res != TEE_SUCCESS)
             return res;
+        if (decrypt_error) {
+            *error = decrypt_error;
+            return TEE_SUCCESS;
+        }
         text = plain.get();
         text_len = plain.len();
     }
