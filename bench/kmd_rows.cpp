@@ -5,7 +5,6 @@
  * socket leaves of the embedded speed. Both sides send the same three
  * commands with requests built once.
  */
-#include <cerrno>
 #include <chrono>
 #include <csignal>
 #include <filesystem>
@@ -13,7 +12,6 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
-#include <system_error>
 #include <thread>
 
 #include <spawn.h>
@@ -39,13 +37,9 @@ using Invoke = std::function<Reply(uint32_t command, uint32_t a, const Bytes &in
 // SIGTERM when the last row holding it goes.
 class KmdServer {
   public:
-    KmdServer() {
-        std::string tmpl = (std::filesystem::temp_directory_path() / "km-bench-kmd-XXXXXX").string();
-        if (!mkdtemp(tmpl.data()))
-            throw std::system_error(errno, std::generic_category(), "cannot create a directory for kmd");
-        dir_ = tmpl;
-        socket_ = dir_ / "kmd.sock";
-        std::string state = (dir_ / "state").string(), sock = socket_.string();
+    KmdServer() : dir_("km-bench-kmd") {
+        socket_ = dir_.path() / "kmd.sock";
+        std::string state = (dir_.path() / "state").string(), sock = socket_.string();
         std::string args[] = {KMD_PATH, "--foreground", "--log-level", "none", "--state", state, "--socket", sock};
         char *argv[] = {args[0].data(), args[1].data(), args[2].data(), args[3].data(), args[4].data(),
                         args[5].data(), args[6].data(), args[7].data(), nullptr};
@@ -85,11 +79,9 @@ class KmdServer {
             int status = 0;
             waitpid(pid_, &status, 0);
         }
-        std::error_code ec;
-        std::filesystem::remove_all(dir_, ec);
     }
 
-    std::filesystem::path dir_;
+    TempDir dir_;
     std::filesystem::path socket_;
     pid_t pid_ = -1;
     std::unique_ptr<km::SocketTransport> transport_;
@@ -106,10 +98,8 @@ Bytes two_fields(const Bytes &first, const Bytes &second) {
 class MacOperation {
   public:
     MacOperation(Invoke invoke, const Bytes &blob, const Bytes &msg) : invoke_(std::move(invoke)), response_(4096) {
-        km::ParamSet begin;
-        begin.add(KM_TAG_DIGEST, KM_DIGEST_SHA_2_256).add(KM_TAG_MAC_LENGTH, 256);
         const Bytes none = km::ParamSet().serialize();
-        begin_ = two_fields(blob, begin.serialize());
+        begin_ = two_fields(blob, hmac_begin_params().serialize());
         update_ = two_fields(msg, none);
         finish_ = two_fields({}, none);
     }
@@ -145,32 +135,23 @@ Bytes import_over(const Invoke &invoke, const km::ParamSet &params, const Bytes 
 
 } // namespace
 
-std::vector<Row> kmd_rows(TaSession &ta) {
+std::vector<Row> kmd_rows(TaSession &ta, const Hsm &) {
     auto kmd = std::make_shared<KmdServer>();
     Invoke through_kmd = [kmd](uint32_t c, uint32_t a, const Bytes &in, Bytes &out) {
         return kmd->invoke(c, a, in, out);
     };
     Invoke embedded = [&ta](uint32_t c, uint32_t a, const Bytes &in, Bytes &out) { return ta.invoke(c, a, in, out); };
     const Bytes key(32, 0xA5);
-    km::ParamSet params;
-    params.add(KM_TAG_ALGORITHM, KM_ALGORITHM_HMAC)
-        .add(KM_TAG_DIGEST, KM_DIGEST_SHA_2_256)
-        .add(KM_TAG_MIN_MAC_LENGTH, 256)
-        .add(KM_TAG_PURPOSE, KM_PURPOSE_SIGN)
-        .add_bool(KM_TAG_NO_AUTH_REQUIRED);
+    const km::ParamSet params = hmac_key_params();
     const Bytes msg = message(64);
     auto over_kmd = std::make_shared<MacOperation>(through_kmd, import_over(through_kmd, params, key), msg);
     auto in_process = std::make_shared<MacOperation>(embedded, import_over(embedded, params, key), msg);
     if (over_kmd->run() != in_process->run())
         throw std::runtime_error("hmac_sha256_kmd 64B: kmd and the embedded TA disagree");
-    return {Row{
-        "hmac_sha256_kmd",
-        "64B",
-        64,
-        0, // informational: embedded time / time through kmd
-        [over_kmd] { benchmark::DoNotOptimize(over_kmd->run().data()); },
-        [in_process] { benchmark::DoNotOptimize(in_process->run().data()); },
-    }};
+    // Informational: embedded time / time through kmd.
+    return {timed_row(
+        "hmac_sha256_kmd_64B", 64, 0, [over_kmd] { benchmark::DoNotOptimize(over_kmd->run().data()); },
+        [in_process] { benchmark::DoNotOptimize(in_process->run().data()); })};
 }
 
 } // namespace bench

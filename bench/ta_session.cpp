@@ -35,21 +35,28 @@ TaFailure::TaFailure(const std::string &what, const Reply &r)
     : std::runtime_error(what + " failed: TEE result " + hex32(r.res) + ", Keymaster error " +
                          std::to_string(r.error)) {}
 
-TaSession::TaSession() {
-    std::string tmpl = (std::filesystem::temp_directory_path() / "km-bench-XXXXXX").string();
+TempDir::TempDir(const std::string &prefix, const std::filesystem::path &parent) {
+    const std::filesystem::path where = parent.empty() ? std::filesystem::temp_directory_path() : parent;
+    std::string tmpl = (where / (prefix + "-XXXXXX")).string();
     if (!mkdtemp(tmpl.data()))
-        throw std::system_error(errno, std::generic_category(), "cannot create a state directory");
-    state_dir_ = tmpl;
+        throw std::system_error(errno, std::generic_category(), "cannot create a directory in " + tmpl);
+    path_ = tmpl;
+}
+
+TempDir::~TempDir() {
+    std::error_code ec;
+    std::filesystem::remove_all(path_, ec);
+}
+
+TaSession::TaSession() : state_dir_("km-bench") {
     tee_host::Config config;
-    config.state_dir = state_dir_;
+    config.state_dir = state_dir_.path();
     config.trace_level = 0;
     tee_ = std::make_unique<tee_host::Tee>(config);
     tee_->install_ta(&keymaster_ta_header);
     TEE_Result res = tee_->open_session(keymaster_ta_uuid, tee_host::normal_world_identity(), 0, nullptr, &session_);
     if (res != TEE_SUCCESS) {
         tee_.reset();
-        std::error_code ec;
-        std::filesystem::remove_all(state_dir_, ec);
         throw TaFailure("open_session", Reply{res, 0, 0, 0});
     }
 }
@@ -57,8 +64,6 @@ TaSession::TaSession() {
 TaSession::~TaSession() {
     tee_->close_session(session_);
     tee_.reset();
-    std::error_code ec;
-    std::filesystem::remove_all(state_dir_, ec);
 }
 
 Reply TaSession::invoke(uint32_t command, uint32_t a, const Bytes &in, Bytes &out) {
@@ -80,11 +85,31 @@ Bytes TaSession::import_key(const km::ParamSet &params, const Bytes &material) {
     return Bytes(out.begin() + 4, out.begin() + 4 + blob_len);
 }
 
+void TaSession::abort(uint32_t handle) {
+    TEE_Param p[4] = {};
+    p[0].value.a = handle;
+    Reply r;
+    r.res = tee_->invoke(session_, KM_CMD_ABORT, TEE_PARAM_TYPES(TEE_PARAM_TYPE_VALUE_INOUT, 0, 0, 0), p);
+    r.error = static_cast<int32_t>(p[0].value.a);
+    if (!r.ok())
+        throw TaFailure("abort", r);
+}
+
 TaOperation::TaOperation(TaSession &ta, uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params,
                          const Bytes &input, const Bytes &signature, size_t output_capacity)
+    : TaOperation(ta, purpose, std::vector<Bytes>{blob}, begin_params, input, signature, output_capacity) {}
+
+TaOperation::TaOperation(TaSession &ta, uint32_t purpose, const std::vector<Bytes> &blobs,
+                         const km::ParamSet &begin_params, const Bytes &input, const Bytes &signature,
+                         size_t output_capacity)
     : ta_(ta), purpose_(purpose), input_(input) {
+    if (blobs.empty())
+        throw std::invalid_argument("TaOperation needs a key blob");
     const Bytes no_params = km::ParamSet().serialize();
-    begin_request_ = two_fields(blob, begin_params.serialize());
+    const Bytes begin_params_bytes = begin_params.serialize();
+    begin_requests_.reserve(blobs.size());
+    for (const Bytes &blob : blobs)
+        begin_requests_.push_back(two_fields(blob, begin_params_bytes));
     update_request_ = two_fields(input, no_params);
     finish_request_ = two_fields(signature, no_params);
     // Room for whatever an update may return (ciphers) or finish produce.
@@ -111,16 +136,22 @@ void TaOperation::update_all(uint32_t handle) {
     }
 }
 
-const Bytes &TaOperation::run() {
-    output_.clear();
-    Reply r = ta_.invoke(KM_CMD_BEGIN, purpose_, begin_request_, response_);
+uint32_t TaOperation::begin() {
+    const Bytes &request = begin_requests_[next_];
+    next_ = next_ + 1 == begin_requests_.size() ? 0 : next_ + 1;
+    Reply r = ta_.invoke(KM_CMD_BEGIN, purpose_, request, response_);
     if (!r.ok())
         throw TaFailure("begin", r);
-    const uint32_t handle = r.b;
+    return r.b;
+}
+
+const Bytes &TaOperation::run() {
+    output_.clear();
+    const uint32_t handle = begin();
     // A failed update ends the operation in the TA, so nothing to abort.
     if (!input_.empty())
         update_all(handle);
-    r = ta_.invoke(KM_CMD_FINISH, handle, finish_request_, response_);
+    Reply r = ta_.invoke(KM_CMD_FINISH, handle, finish_request_, response_);
     if (!r.ok() || r.out_len < 8)
         throw TaFailure("finish", r);
     uint32_t len = km::get_u32(response_.data());

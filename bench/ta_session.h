@@ -56,6 +56,20 @@ class TaFailure : public std::runtime_error {
     TaFailure(const std::string &what, const Reply &r);
 };
 
+// A fresh directory prefix-XXXXXX in parent (by default the system's
+// temporary directory), removed with all it holds on destruction.
+class TempDir {
+  public:
+    explicit TempDir(const std::string &prefix, const std::filesystem::path &parent = {});
+    ~TempDir();
+    TempDir(const TempDir &) = delete;
+    TempDir &operator=(const TempDir &) = delete;
+    const std::filesystem::path &path() const { return path_; }
+
+  private:
+    std::filesystem::path path_;
+};
+
 // A fresh TEE with a temporary state directory, silent, with one
 // normal-world session into the Keymaster TA. One per process.
 class TaSession {
@@ -72,19 +86,29 @@ class TaSession {
     // import_key - the key blob for this material; throws when refused.
     Bytes import_key(const km::ParamSet &params, const Bytes &material);
 
+    // abort - ends the operation `handle`; throws when refused.
+    void abort(uint32_t handle);
+
   private:
-    std::filesystem::path state_dir_;
+    TempDir state_dir_;
     std::unique_ptr<tee_host::Tee> tee_;
     uint32_t session_ = 0;
 };
 
-// One operation on one key, repeatable: the begin, update and finish
-// requests are serialized once, so run() costs only the commands.
+// One operation, repeatable: the begin, update and finish requests are
+// serialized once, so run() costs only the commands. Given several key
+// blobs, each run begins with the next one, round-robin.
 class TaOperation {
   public:
     // signature is what finish carries (verification); empty otherwise.
     TaOperation(TaSession &ta, uint32_t purpose, const Bytes &blob, const km::ParamSet &begin_params,
                 const Bytes &input, const Bytes &signature = {}, size_t output_capacity = 4096);
+    TaOperation(TaSession &ta, uint32_t purpose, const std::vector<Bytes> &blobs, const km::ParamSet &begin_params,
+                const Bytes &input, const Bytes &signature = {}, size_t output_capacity = 4096);
+
+    // begin - begins on the next key; the operation handle, which the
+    // caller finishes or aborts. Throws when refused.
+    uint32_t begin();
 
     // run - begin, update until all input is taken, finish. Returns the
     // update outputs followed by the finish output; throws when refused.
@@ -96,7 +120,8 @@ class TaOperation {
     TaSession &ta_;
     uint32_t purpose_;
     Bytes input_;
-    Bytes begin_request_;
+    std::vector<Bytes> begin_requests_;
+    size_t next_ = 0;
     Bytes update_request_;
     Bytes finish_request_;
     Bytes response_;

@@ -5,7 +5,7 @@
 set -euo pipefail
 # The normal configuration builds the TA for aarch64 too (g++-aarch64-linux-gnu)
 # and checks its stack with python3.
-pkgs=(cmake ninja-build g++ pkg-config libssl-dev libgtest-dev libgmock-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev help2man clang-format openssl
+pkgs=(cmake ninja-build g++ pkg-config libssl-dev libgtest-dev libgmock-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev help2man clang-format openssl libp11-kit-dev
       g++-aarch64-linux-gnu python3)
 # The fuzz harnesses (scripts/fuzz.sh): clang 14, its sanitizer and libFuzzer
 # runtimes, and llvm-symbolizer for their reports.

@@ -202,8 +202,8 @@ void *reallocate(void *buffer, uint32_t new_size, const char *file, int line) {
     std::memcpy(p, buffer, old.size < new_size ? old.size : new_size);
     std::memset(buffer, 0, old.size); // old contents may be secret
     unpoison_spare(buffer, old.size);
-    std::free(buffer);
     s.blocks.erase(buffer);
+    std::free(buffer);
     s.blocks.insert(p, Block{old.owner, new_size, file ? file : old.file, file ? line : old.line, ++s.seq});
     s.live_bytes = s.live_bytes - old.size + new_size;
     if (s.live_bytes > s.peak_bytes)
