@@ -8,7 +8,9 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <string>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include "rsa_keys.h"
 #include "soter_keys.h"
@@ -108,7 +110,8 @@ FuzzTee &FuzzTee::instance() {
 
 FuzzTee::FuzzTee() {
     if (const char *d = std::getenv("KM_FUZZ_STATE"); d && *d) {
-        dir_ = d;
+        // One device per process: -jobs runs several harness processes at once.
+        dir_ = fs::path(d) / ("pid-" + std::to_string(getpid()));
         std::error_code ec;
         fs::remove_all(dir_, ec); // a run starts on a fresh device
         fs::create_directories(dir_);

@@ -53,7 +53,9 @@ scratch="$build/scratch/$target"
 mkdir -p "$scratch/corpus"
 export ASAN_OPTIONS=${ASAN_OPTIONS:-detect_leaks=1:abort_on_error=1:symbolize=1}
 export UBSAN_OPTIONS=${UBSAN_OPTIONS:-print_stacktrace=1:halt_on_error=1}
-# The harness's emulated TEE keeps its state here, out of the tree.
+# The harness's emulated TEE keeps its state here, out of the tree, one
+# directory per harness process (-jobs starts several).
+rm -rf "$scratch/state"
 export KM_FUZZ_STATE="$scratch/state"
 cd "$scratch"
 # The first directory receives new inputs; the tree's seeds are only read.
