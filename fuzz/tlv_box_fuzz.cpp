@@ -63,7 +63,7 @@ void check_lookups(const tlv_box *box, const std::map<uint16_t, Bytes> &entries,
                        dest[value.size()] == 0 && dest[value.size() + 2] == 0,
                    "type 0x%04x: copy or zero fill wrong", type);
         int32_t i32 = 0;
-        const int got = tlv_box_get_int(box, type, &i32);
+        const int got = tlv_box_get_value(box, type, &i32);
         FUZZ_CHECK(got == (value.size() >= 4 ? 0 : -1), "type 0x%04x: int get of %zu bytes gave %d", type, value.size(),
                    got);
         if (got == 0)
@@ -76,7 +76,7 @@ void check_lookups(const tlv_box *box, const std::map<uint16_t, Bytes> &entries,
         uint32_t len = 0;
         uint8_t c = 0;
         FUZZ_CHECK(tlv_box_get_bytes_ptr(box, other, &p, &len) == -1 &&
-                       tlv_box_get_char(box, other, reinterpret_cast<char *>(&c)) == -1,
+                       tlv_box_get_value(box, other, reinterpret_cast<char *>(&c)) == -1,
                    "absent type 0x%04x found", other);
     }
     // One value read as a nested box, parsed by the same rules.

@@ -25,18 +25,6 @@ const tlv_entry_t *find_entry(const tlv_box *box, uint16_t type) {
     return static_cast<const tlv_entry_t *>(value);
 }
 
-template <typename T> int get_fixed(const tlv_box *box, uint16_t type, T *out) {
-    const tlv_entry_t *entry = find_entry(box, type);
-    if (!entry || !out || entry->length < sizeof(T))
-        return -1;
-    std::memcpy(out, entry->value, sizeof(T));
-    return 0;
-}
-
-template <typename T> int put_fixed(tlv_box *box, uint16_t type, T value) {
-    return tlv_box_putobject(box, type, &value, sizeof(T));
-}
-
 } // namespace
 
 tlv_box *tlv_box_create() {
@@ -195,28 +183,6 @@ int tlv_box_get_object(const tlv_box *box, uint16_t type, tlv_box **object) {
     return *object ? 0 : -1;
 }
 
-int tlv_box_put_char(tlv_box *box, uint16_t type, char value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_short(tlv_box *box, uint16_t type, int16_t value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_int(tlv_box *box, uint16_t type, int32_t value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_long(tlv_box *box, uint16_t type, int32_t value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_longlong(tlv_box *box, uint16_t type, int64_t value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_float(tlv_box *box, uint16_t type, float value) {
-    return put_fixed(box, type, value);
-}
-int tlv_box_put_double(tlv_box *box, uint16_t type, double value) {
-    return put_fixed(box, type, value);
-}
-
 int tlv_box_put_string(tlv_box *box, uint16_t type, const char *value) {
     if (!value)
         return -1;
@@ -234,28 +200,6 @@ int tlv_box_put_object(tlv_box *box, uint16_t type, const tlv_box *object) {
     if (!object || !object->serialized)
         return -1;
     return tlv_box_putobject(box, type, object->serialized, object->serialized_size);
-}
-
-int tlv_box_get_char(const tlv_box *box, uint16_t type, char *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_short(const tlv_box *box, uint16_t type, int16_t *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_int(const tlv_box *box, uint16_t type, int32_t *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_long(const tlv_box *box, uint16_t type, int32_t *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_longlong(const tlv_box *box, uint16_t type, int64_t *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_float(const tlv_box *box, uint16_t type, float *value) {
-    return get_fixed(box, type, value);
-}
-int tlv_box_get_double(const tlv_box *box, uint16_t type, double *value) {
-    return get_fixed(box, type, value);
 }
 
 int tlv_box_get_string(const tlv_box *box, uint16_t type, char *value, int32_t *length) {

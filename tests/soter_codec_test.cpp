@@ -66,7 +66,7 @@ TEST_F(Codec, TlvParseFindsEveryEntryAndFirstDuplicateWins) {
     uint32_t n = 0;
     EXPECT_EQ(tlv_box_get_bytes_ptr(box, 18, &p, &n), -1);
     // Frozen from birth.
-    EXPECT_EQ(tlv_box_put_int(box, 1, 5), -1);
+    EXPECT_EQ(tlv_box_put_value(box, 1, 5), -1);
     EXPECT_EQ(tlv_box_serialize(box), -1);
     EXPECT_EQ(tlv_box_destroy(box), 0);
 }
@@ -104,7 +104,7 @@ TEST_F(Codec, TlvBuildSerializeRoundTrip) {
     // Newest first.
     EXPECT_EQ(serialized(box), concat({tlv(3, Bytes(10, 3)), tlv(2, {}), tlv(1, Bytes(5, 1))}));
     EXPECT_EQ(tlv_box_serialize(box), -1);
-    EXPECT_EQ(tlv_box_put_char(box, 9, 'x'), -1);
+    EXPECT_EQ(tlv_box_put_value(box, 9, 'x'), -1);
 
     tlv_box *back = tlv_box_parse(tlv_box_get_buffer(box), tlv_box_get_size(box));
     ASSERT_NE(back, nullptr);
@@ -143,15 +143,16 @@ TEST_F(Codec, TlvTypedValuesAndNesting) {
     EXPECT_EQ(tlv_box_put_object(outer, 10, inner), -1) << "the nested box must be serialized first";
     ASSERT_EQ(tlv_box_serialize(inner), 0);
     EXPECT_EQ(tlv_box_put_object(outer, 10, inner), 0);
-    EXPECT_EQ(tlv_box_put_char(outer, 1, 'c'), 0);
-    EXPECT_EQ(tlv_box_put_short(outer, 2, -2), 0);
-    EXPECT_EQ(tlv_box_put_int(outer, 3, -300000), 0);
-    EXPECT_EQ(tlv_box_put_long(outer, 4, 123456), 0);
-    EXPECT_EQ(tlv_box_put_longlong(outer, 5, -(int64_t{1} << 40)), 0);
-    EXPECT_EQ(tlv_box_put_float(outer, 6, 1.5f), 0);
-    EXPECT_EQ(tlv_box_put_double(outer, 7, -2.25), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 1, 'c'), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 2, int16_t{-2}), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 3, -300000), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 4, int32_t{123456}), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 5, -(int64_t{1} << 40)), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 6, 1.5f), 0);
+    EXPECT_EQ(tlv_box_put_value(outer, 7, -2.25), 0);
     EXPECT_EQ(tlv_box_put_string(outer, 8, "text"), 0);
     EXPECT_EQ(value_of(outer, 8), (Bytes{'t', 'e', 'x', 't', 0}));
+    EXPECT_EQ(value_of(outer, 2).size(), 2u);
     EXPECT_EQ(value_of(outer, 4).size(), 4u);
     EXPECT_EQ(value_of(outer, 5).size(), 8u);
     ASSERT_EQ(tlv_box_serialize(outer), 0);
@@ -163,13 +164,13 @@ TEST_F(Codec, TlvTypedValuesAndNesting) {
     int64_t ll = 0;
     float f = 0;
     double d = 0;
-    EXPECT_EQ(tlv_box_get_char(back, 1, &c), 0);
-    EXPECT_EQ(tlv_box_get_short(back, 2, &s), 0);
-    EXPECT_EQ(tlv_box_get_int(back, 3, &i), 0);
-    EXPECT_EQ(tlv_box_get_long(back, 4, &l), 0);
-    EXPECT_EQ(tlv_box_get_longlong(back, 5, &ll), 0);
-    EXPECT_EQ(tlv_box_get_float(back, 6, &f), 0);
-    EXPECT_EQ(tlv_box_get_double(back, 7, &d), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 1, &c), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 2, &s), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 3, &i), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 4, &l), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 5, &ll), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 6, &f), 0);
+    EXPECT_EQ(tlv_box_get_value(back, 7, &d), 0);
     EXPECT_EQ(c, 'c');
     EXPECT_EQ(s, -2);
     EXPECT_EQ(i, -300000);
@@ -178,8 +179,8 @@ TEST_F(Codec, TlvTypedValuesAndNesting) {
     EXPECT_EQ(f, 1.5f);
     EXPECT_EQ(d, -2.25);
     // A value shorter than the width is refused rather than over-read.
-    EXPECT_EQ(tlv_box_get_longlong(back, 3, &ll), -1);
-    EXPECT_EQ(tlv_box_get_int(back, 99, &i), -1);
+    EXPECT_EQ(tlv_box_get_value(back, 3, &ll), -1);
+    EXPECT_EQ(tlv_box_get_value(back, 99, &i), -1);
     char text[16] = {};
     int32_t cap = sizeof text;
     EXPECT_EQ(tlv_box_get_string(back, 8, text, &cap), 0);

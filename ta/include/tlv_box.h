@@ -12,6 +12,8 @@
 #define TLV_BOX_H
 
 #include <cstdint>
+#include <cstring>
+#include <type_traits>
 
 #include "key_list.h"
 
@@ -69,31 +71,34 @@ int tlv_box_get_bytes_ptr(const tlv_box *box, uint16_t type, const uint8_t **val
 /* tlv_box_get_object - the value parsed as a nested box, which the caller destroys. */
 int tlv_box_get_object(const tlv_box *box, uint16_t type, tlv_box **object);
 
-/* Typed puts: the value's bytes in native order (strings with their NUL). */
-int tlv_box_put_char(tlv_box *box, uint16_t type, char value);
-int tlv_box_put_short(tlv_box *box, uint16_t type, int16_t value);
-int tlv_box_put_int(tlv_box *box, uint16_t type, int32_t value);
-int tlv_box_put_long(tlv_box *box, uint16_t type, int32_t value);
-int tlv_box_put_longlong(tlv_box *box, uint16_t type, int64_t value);
-int tlv_box_put_float(tlv_box *box, uint16_t type, float value);
-int tlv_box_put_double(tlv_box *box, uint16_t type, double value);
+/* Typed puts: strings with their NUL, runs of bytes, nested boxes. */
 int tlv_box_put_string(tlv_box *box, uint16_t type, const char *value);
 int tlv_box_put_bytes(tlv_box *box, uint16_t type, const uint8_t *value, uint32_t length);
 /* tlv_box_put_object - the nested box's serialized bytes; -1 unless it was serialized first. */
 int tlv_box_put_object(tlv_box *box, uint16_t type, const tlv_box *object);
 
 /*
- * Typed gets: a fixed-width get copies exactly its width and fails (-1)
- * when the type is absent or its stored value is shorter than the width.
- * tlv_box_get_string is tlv_box_get_bytes on a char buffer.
+ * tlv_box_put_value / tlv_box_get_value - the fixed-width kinds (char,
+ * short, int, long as 32 bits, long long, float, double): the value's
+ * bytes in native order. A get copies exactly sizeof(T) bytes and fails
+ * (-1) when the type is absent or its stored value is shorter.
  */
-int tlv_box_get_char(const tlv_box *box, uint16_t type, char *value);
-int tlv_box_get_short(const tlv_box *box, uint16_t type, int16_t *value);
-int tlv_box_get_int(const tlv_box *box, uint16_t type, int32_t *value);
-int tlv_box_get_long(const tlv_box *box, uint16_t type, int32_t *value);
-int tlv_box_get_longlong(const tlv_box *box, uint16_t type, int64_t *value);
-int tlv_box_get_float(const tlv_box *box, uint16_t type, float *value);
-int tlv_box_get_double(const tlv_box *box, uint16_t type, double *value);
+template <typename T>
+requires std::is_arithmetic_v<T>
+int tlv_box_put_value(tlv_box *box, uint16_t type, T value) {
+    return tlv_box_putobject(box, type, &value, sizeof(T));
+}
+template <typename T>
+requires std::is_arithmetic_v<T>
+int tlv_box_get_value(const tlv_box *box, uint16_t type, T *value) {
+    const uint8_t *stored = nullptr;
+    uint32_t length = 0;
+    if (!value || tlv_box_get_bytes_ptr(box, type, &stored, &length) != 0 || length < sizeof(T))
+        return -1;
+    std::memcpy(value, stored, sizeof(T));
+    return 0;
+}
+/* tlv_box_get_string - tlv_box_get_bytes on a char buffer. */
 int tlv_box_get_string(const tlv_box *box, uint16_t type, char *value, int32_t *length);
 
 #endif
