@@ -356,7 +356,7 @@ uint32_t aes_get_padding(keymaster_key_param_set_t *in_params, uint32_t *value) 
     return 0;
 }
 
-constexpr purpose_ops_t cipher_table(decltype(purpose_ops_t::create_operation) create) {
+constexpr purpose_ops_t cipher_table(create_operation_fn *create) {
     // clang-format off
     return purpose_ops_t{.block_mode_count = list_count<kBlockModes>, .get_block_modes = list_write<kBlockModes>,
         .padding_count = list_count<kPaddings>, .get_paddings = list_write<kPaddings>,

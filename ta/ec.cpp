@@ -284,8 +284,8 @@ operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len,
     return nullptr;
 }
 
-TEE_Result ec_operation_update(operation_t *header, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
-                               int32_t *error) {
+TEE_Result ec_operation_update(operation_t *header, keymaster_key_param_set_t *, const uint8_t *input,
+                               uint32_t *input_len, uint8_t *, uint32_t *output_len, int32_t *error) {
     auto *op = operation_record<ec_operation_t>(header);
     *output_len = 0;
     if (op->digest_operation) {

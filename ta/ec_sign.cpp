@@ -8,11 +8,6 @@
 
 namespace {
 
-TEE_Result ec_sign_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
-                          uint8_t *, uint32_t *output_len, int32_t *error) {
-    return ec_operation_update(op, input, input_len, output_len, error);
-}
-
 TEE_Result ec_sign_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *, uint32_t, uint8_t **output,
                           uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
     auto *op = operation_record<ec_sign_operation_t>(header);
@@ -48,8 +43,8 @@ TEE_Result ec_sign_finish(operation_t *header, keymaster_key_param_set_t *, cons
     return TEE_SUCCESS;
 }
 
-const operation_fns_t kSignFns =
-    operation_fns<ec_sign_operation_t>("ec_sign_operation_t", ec_sign_update, ec_sign_finish, ec_operation_release);
+const operation_fns_t kSignFns = operation_fns<ec_sign_operation_t>("ec_sign_operation_t", ec_operation_update,
+                                                                    ec_sign_finish, ec_operation_release);
 
 } // namespace
 

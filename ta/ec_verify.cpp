@@ -9,11 +9,6 @@
 
 namespace {
 
-TEE_Result ec_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
-                            uint8_t *, uint32_t *output_len, int32_t *error) {
-    return ec_operation_update(op, input, input_len, output_len, error);
-}
-
 TEE_Result ec_verify_finish(operation_t *header, keymaster_key_param_set_t *, const uint8_t *signature,
                             uint32_t signature_len, uint8_t **output, uint32_t *output_len, keymaster_key_param_set_t *,
                             int32_t *error) {
@@ -50,7 +45,7 @@ TEE_Result ec_verify_finish(operation_t *header, keymaster_key_param_set_t *, co
     return TEE_SUCCESS;
 }
 
-const operation_fns_t kVerifyFns = operation_fns<ec_verify_operation_t>("ec_verify_operation_t", ec_verify_update,
+const operation_fns_t kVerifyFns = operation_fns<ec_verify_operation_t>("ec_verify_operation_t", ec_operation_update,
                                                                         ec_verify_finish, ec_operation_release);
 
 } // namespace

@@ -220,8 +220,8 @@ operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_le
     return nullptr;
 }
 
-TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
-                                 int32_t *error) {
+TEE_Result hmac_operation_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input,
+                                 uint32_t *input_len, uint8_t *, uint32_t *output_len, int32_t *error) {
     TEE_MACUpdate(operation_record<hmac_operation_t>(op)->operation, input, *input_len);
     *output_len = 0;
     *error = KM_ERROR_OK;

@@ -7,11 +7,6 @@
 
 namespace {
 
-TEE_Result hmac_sign_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
-                            uint8_t *, uint32_t *output_len, int32_t *error) {
-    return hmac_operation_update(op, input, input_len, output_len, error);
-}
-
 TEE_Result hmac_sign_finish(operation_t *op, keymaster_key_param_set_t *, const uint8_t *, uint32_t, uint8_t **output,
                             uint32_t *output_len, keymaster_key_param_set_t *, int32_t *error) {
     auto *h = operation_record<hmac_sign_operation_t>(op);
@@ -37,7 +32,7 @@ TEE_Result hmac_sign_finish(operation_t *op, keymaster_key_param_set_t *, const 
     return TEE_SUCCESS;
 }
 
-const operation_fns_t kSignFns = operation_fns<hmac_sign_operation_t>("hmac_sign_operation_t", hmac_sign_update,
+const operation_fns_t kSignFns = operation_fns<hmac_sign_operation_t>("hmac_sign_operation_t", hmac_operation_update,
                                                                       hmac_sign_finish, hmac_operation_release);
 
 } // namespace

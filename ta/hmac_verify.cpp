@@ -8,11 +8,6 @@
 
 namespace {
 
-TEE_Result hmac_verify_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input, uint32_t *input_len,
-                              uint8_t *, uint32_t *output_len, int32_t *error) {
-    return hmac_operation_update(op, input, input_len, output_len, error);
-}
-
 // A signature of any other length than the MAC length is a mismatch; the
 // comparison never reads past either buffer and takes the same time for
 // any content.
@@ -40,8 +35,8 @@ TEE_Result hmac_verify_finish(operation_t *op, keymaster_key_param_set_t *, cons
     return TEE_SUCCESS;
 }
 
-const operation_fns_t kVerifyFns = operation_fns<hmac_verify_operation_t>("hmac_verify_operation_t", hmac_verify_update,
-                                                                          hmac_verify_finish, hmac_operation_release);
+const operation_fns_t kVerifyFns = operation_fns<hmac_verify_operation_t>(
+    "hmac_verify_operation_t", hmac_operation_update, hmac_verify_finish, hmac_operation_release);
 
 } // namespace
 

@@ -549,9 +549,7 @@ uint32_t sign_get_digest(keymaster_key_param_set_t *in_params, uint32_t *value) 
     return param_getter_digest(in_params, value);
 }
 
-using create_fn = decltype(purpose_ops_t::create_operation);
-
-constexpr purpose_ops_t rsa_table(create_fn create, bool signing) {
+constexpr purpose_ops_t rsa_table(create_operation_fn *create, bool signing) {
     const auto padding_count = signing ? list_count<kSignPaddings> : list_count<kCipherPaddings>;
     const auto paddings = signing ? list_write<kSignPaddings> : list_write<kCipherPaddings>;
     const auto get_digest = signing ? sign_get_digest : cipher_get_digest;

@@ -16,10 +16,8 @@ constexpr uint32_t kAesBlock = 16;
  * returned in a buffer the caller frees. Refusals set *error; generation
  * reports no memory as TEE_ERROR_OUT_OF_MEMORY, import as error -41.
  */
-TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                            int32_t *error);
-TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                          uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+generate_key_fn aes_generate_key;
+import_key_fn aes_import_key;
 
 /*
  * aes_resolve_key_data - a TEE AES key object from key data. On success
@@ -27,8 +25,7 @@ TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *mate
  * given) its bits; key data too short is TEE_ERROR_GENERIC, and any
  * failure leaves *object null. The size itself is left to the TEE.
  */
-TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
-                                uint32_t *key_size, int32_t *error);
+resolve_key_data_fn aes_resolve_key_data;
 
 /*
  * aes_encrypt_operation_t / aes_decrypt_operation_t - one layout for both
@@ -95,14 +92,9 @@ TEE_Result aes_cipher_final(aes_operation_t *op, int32_t *error, const char *fun
  * TEE operation, each required of a complete record, then the decryption
  * buffers when present.
  */
-void aes_operation_release(operation_t *op, bool audit);
+release_fn aes_operation_release;
 
 /* create_aes_encrypt / create_aes_decrypt - the create slots of the AES encrypt and decrypt tables. */
-operation_t *create_aes_encrypt(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
-                                keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
-                                int32_t *error);
-operation_t *create_aes_decrypt(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
-                                keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
-                                int32_t *error);
+create_operation_fn create_aes_encrypt, create_aes_decrypt;
 
 #endif

@@ -14,6 +14,35 @@
 struct operation_t;
 
 /*
+ * The slot signatures, named once: the tables below hold pointers of these
+ * types and each family declares its slot functions with them.
+ *
+ * create_operation_fn - builds an operation record; null on failure with
+ * the reason in *error. update_fn, finish_fn - a record's steps.
+ * release_fn - see operation_fns_t. generate_key_fn, import_key_fn - key
+ * data in a buffer the caller frees. export_key_fn - public material into
+ * out (capacity *out_len). resolve_key_data_fn - a new TEE key object the
+ * caller frees, and its size in bits when key_size is given.
+ */
+using create_operation_fn = operation_t *(const uint8_t *key_data, uint32_t key_data_len,
+                                          keymaster_key_param_set_t *key_params, keymaster_key_param_set_t *in_params,
+                                          keymaster_key_param_set_t *out_params, int32_t *error);
+using update_fn = TEE_Result(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *input,
+                             uint32_t *input_len, uint8_t *output, uint32_t *output_len, int32_t *error);
+using finish_fn = TEE_Result(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *signature,
+                             uint32_t signature_len, uint8_t **output, uint32_t *output_len,
+                             keymaster_key_param_set_t *out_params, int32_t *error);
+using release_fn = void(operation_t *op, bool audit);
+using generate_key_fn = TEE_Result(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                                   int32_t *error);
+using import_key_fn = TEE_Result(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                                 uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+using export_key_fn = TEE_Result(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
+                                 int32_t *error);
+using resolve_key_data_fn = TEE_Result(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
+                                       uint32_t *key_size, int32_t *error);
+
+/*
  * operation_fns_t - the one constant table of an operation record's
  * functions. Every record of a kind points at the same table.
  *
@@ -26,12 +55,9 @@ struct operation_t;
 struct operation_fns_t {
     const char *record_name;
     uint32_t record_size; // bytes of the whole record, header included
-    TEE_Result (*update)(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *input,
-                         uint32_t *input_len, uint8_t *output, uint32_t *output_len, int32_t *error);
-    TEE_Result (*finish)(operation_t *op, keymaster_key_param_set_t *in_params, const uint8_t *signature,
-                         uint32_t signature_len, uint8_t **output, uint32_t *output_len,
-                         keymaster_key_param_set_t *out_params, int32_t *error);
-    void (*release)(operation_t *op, bool audit);
+    update_fn *update;
+    finish_fn *finish;
+    release_fn *release;
 };
 
 /*
@@ -56,9 +82,8 @@ operation_t *operation_record_alloc(const operation_fns_t *fns, const char *func
  * size, and its three functions.
  */
 template <typename Record>
-constexpr operation_fns_t operation_fns(const char *record_name, decltype(operation_fns_t::update) update,
-                                        decltype(operation_fns_t::finish) finish,
-                                        decltype(operation_fns_t::release) release) {
+constexpr operation_fns_t operation_fns(const char *record_name, update_fn *update, finish_fn *finish,
+                                        release_fn *release) {
     return operation_fns_t{
         .record_name = record_name,
         .record_size = sizeof(Record),
@@ -114,9 +139,7 @@ struct purpose_ops_t {
     void (*get_paddings)(uint32_t *out);
     uint32_t (*digest_count)();
     void (*get_digests)(uint32_t *out);
-    operation_t *(*create_operation)(const uint8_t *key_data, uint32_t key_data_len,
-                                     keymaster_key_param_set_t *key_params, keymaster_key_param_set_t *in_params,
-                                     keymaster_key_param_set_t *out_params, int32_t *error);
+    create_operation_fn *create_operation;
     uint32_t (*get_padding)(keymaster_key_param_set_t *in_params, uint32_t *value);
     uint32_t (*get_block_mode)(keymaster_key_param_set_t *in_params, uint32_t *value);
     uint32_t (*get_digest)(keymaster_key_param_set_t *in_params, uint32_t *value);
@@ -130,12 +153,9 @@ struct algorithm_provider_t {
     void (*get_import_formats)(uint32_t *out);
     uint32_t (*export_format_count)();
     void (*get_export_formats)(uint32_t *out);
-    TEE_Result (*generate_key)(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                               int32_t *error);
-    TEE_Result (*import_key)(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                             uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
-    TEE_Result (*export_key)(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
-                             int32_t *error);
+    generate_key_fn *generate_key;
+    import_key_fn *import_key;
+    export_key_fn *export_key;
 };
 
 constexpr uint32_t kAlgorithmProviderCount = 4;
@@ -206,7 +226,7 @@ constexpr uint32_t kSigningDigests[] = {KM_DIGEST_MD5,       KM_DIGEST_SHA1,    
  * modes or paddings, kSigningDigests, and the single digest of the request
  * as the one value to authorize.
  */
-constexpr purpose_ops_t digest_signing_table(decltype(purpose_ops_t::create_operation) create) {
+constexpr purpose_ops_t digest_signing_table(create_operation_fn *create) {
     // clang-format off
     return purpose_ops_t{.block_mode_count = list_count_none, .get_block_modes = list_write_none,
         .padding_count = list_count_none, .get_paddings = list_write_none,
@@ -328,7 +348,6 @@ TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin,
 }
 
 /* export_key_unsupported - the export slot of providers without an export format. */
-TEE_Result export_key_unsupported(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
-                                  int32_t *error);
+export_key_fn export_key_unsupported;
 
 #endif

@@ -19,17 +19,14 @@ constexpr uint32_t ec_field_bytes(uint32_t key_size) {
  * parameters are checked and completed (origin, key size), the key data
  * returned in a buffer the caller frees. Refusals set *error.
  */
-TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                           int32_t *error);
-TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                         uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+generate_key_fn ec_generate_key;
+import_key_fn ec_import_key;
 /*
  * ec_export_key - the key size, x and y of the key data, with their length
  * words, into out (capacity *out_len; *out_len the bytes written). Always
  * TEE_SUCCESS; key data or room cut short is *error -1000 and *out_len 0.
  */
-TEE_Result ec_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
-                         int32_t *error);
+export_key_fn ec_export_key;
 /*
  * ec_resolve_key_data - a TEE ECDSA key-pair object from key data; the
  * attributes point into key_data while the object is populated. On
@@ -37,8 +34,7 @@ TEE_Result ec_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t
  * given) its bits. A key size of no supported curve is *error -6 with
  * TEE_SUCCESS and no object; TEE failures are returned.
  */
-TEE_Result ec_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
-                               uint32_t *key_size, int32_t *error);
+resolve_key_data_fn ec_resolve_key_data;
 
 /*
  * ec_operation_t - the record of an ECDSA signing or verifying operation
@@ -71,12 +67,11 @@ using ec_verify_operation_t = ec_operation_t;
 operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                  uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func);
 /*
- * ec_operation_update - feeds the digest, or buffers unhashed input up to
+ * ec_operation_update - the update slot of both tables: feeds the digest, or buffers unhashed input up to
  * one field: what does not fit is reported as not consumed. Nothing is
  * output. Always TEE_SUCCESS.
  */
-TEE_Result ec_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
-                               int32_t *error);
+update_fn ec_operation_update;
 /*
  * ec_operation_message - the value to sign or verify: the digest finished
  * into the message buffer (its failure logged in the caller's name and
@@ -94,12 +89,9 @@ uint32_t ec_truncate_digest(uint8_t *buf, uint32_t len, uint32_t key_size);
  * ECDSA operation and message buffer, each required of a complete record,
  * and the optional digest operation.
  */
-void ec_operation_release(operation_t *op, bool audit);
+release_fn ec_operation_release;
 
 /* create_ec_sign, create_ec_verify - the create slots of the two tables. */
-operation_t *create_ec_sign(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                            keymaster_key_param_set_t *, int32_t *);
-operation_t *create_ec_verify(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                              keymaster_key_param_set_t *, int32_t *);
+create_operation_fn create_ec_sign, create_ec_verify;
 
 #endif

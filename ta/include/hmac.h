@@ -13,10 +13,8 @@
  * parameters are checked and completed (origin, key size), the key data
  * returned in a buffer the caller frees. Refusals set *error.
  */
-TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                             int32_t *error);
-TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+generate_key_fn hmac_generate_key;
+import_key_fn hmac_import_key;
 
 /*
  * hmac_resolve_key_data - a TEE key object from HMAC key data. On success
@@ -52,9 +50,9 @@ using hmac_verify_operation_t = hmac_operation_t;
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                    keymaster_key_param_set_t *out_params, int32_t *error, const operation_fns_t *fns,
                                    const char *func);
-/* hmac_operation_update - feeds the whole input to the MAC; nothing is output. Always TEE_SUCCESS. */
-TEE_Result hmac_operation_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
-                                 int32_t *error);
+/* hmac_operation_update - the update slot of both tables: feeds the whole input to the MAC; nothing is output. Always
+ * TEE_SUCCESS. */
+update_fn hmac_operation_update;
 /*
  * hmac_operation_mac - finishes the MAC into mac (64 bytes); *mac_len its
  * length. A TEE failure is returned; a MAC shorter than the requested
@@ -65,14 +63,9 @@ TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_
  * hmac_operation_release - the release slot of both HMAC tables: frees
  * the key and the TEE operation, each required of a complete record.
  */
-void hmac_operation_release(operation_t *op, bool audit);
+release_fn hmac_operation_release;
 
 /* create_hmac_sign / create_hmac_verify - the create slots of the HMAC sign and verify tables. */
-operation_t *create_hmac_sign(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
-                              keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
-                              int32_t *error);
-operation_t *create_hmac_verify(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *key_params,
-                                keymaster_key_param_set_t *in_params, keymaster_key_param_set_t *out_params,
-                                int32_t *error);
+create_operation_fn create_hmac_sign, create_hmac_verify;
 
 #endif

@@ -16,20 +16,16 @@ constexpr uint32_t kRsaComponents = 8;
  * parameters are checked and completed (origin, key size, exponent), the
  * key data returned in a buffer the caller frees. Refusals set *error.
  */
-TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                            int32_t *error);
-TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                          uint8_t **key_data, uint32_t *key_data_len, int32_t *error);
+generate_key_fn rsa_generate_key;
+import_key_fn rsa_import_key;
 /* rsa_export_key - the DER SubjectPublicKeyInfo into out; every failure is *error -1000. */
-TEE_Result rsa_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,
-                          int32_t *error);
+export_key_fn rsa_export_key;
 /*
  * rsa_resolve_key_data - a TEE RSA key-pair object from key data. The
  * attributes point into key_data while the object is populated. On
  * success *object is a new object the caller frees.
  */
-TEE_Result rsa_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
-                                uint32_t *key_size, int32_t *error);
+resolve_key_data_fn rsa_resolve_key_data;
 
 /*
  * rsa_operation_t - what every RSA record holds: the RSA operation, the
@@ -92,8 +88,8 @@ void rsa_signature_block(rsa_signature_operation_t *op);
  * complete record. rsa_signature_release adds the signature twins' digest
  * operation and SOTER buffer, both optional.
  */
-void rsa_operation_release(operation_t *op, bool audit);
-void rsa_signature_release(operation_t *op, bool audit);
+release_fn rsa_operation_release;
+release_fn rsa_signature_release;
 
 /* rsa_cipher_update - buffers input up to one block (-21 past it); nothing is output. */
 TEE_Result rsa_cipher_update(operation_t *op, const uint8_t *input, uint32_t *input_len, uint32_t *output_len,
@@ -142,13 +138,6 @@ inline uint32_t rsa_salt_attribute(uint32_t padding, uint32_t salt, TEE_Attribut
 uint32_t rsa_digest_length(uint32_t digest);
 
 /* create_rsa_sign, create_rsa_verify, create_rsa_encrypt, create_rsa_decrypt - the create slots of the four tables. */
-operation_t *create_rsa_sign(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                             keymaster_key_param_set_t *, int32_t *);
-operation_t *create_rsa_verify(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                               keymaster_key_param_set_t *, int32_t *);
-operation_t *create_rsa_encrypt(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                                keymaster_key_param_set_t *, int32_t *);
-operation_t *create_rsa_decrypt(const uint8_t *, uint32_t, keymaster_key_param_set_t *, keymaster_key_param_set_t *,
-                                keymaster_key_param_set_t *, int32_t *);
+create_operation_fn create_rsa_sign, create_rsa_verify, create_rsa_encrypt, create_rsa_decrypt;
 
 #endif
