@@ -12,7 +12,6 @@
 
 namespace {
 
-constexpr uint32_t kKeyDataHeader = 4; // the key size word
 constexpr uint32_t kCbcCtrNonce = 16;
 constexpr uint32_t kGcmNonce = 12;
 constexpr uint32_t kMaxNonce = 16;
@@ -21,27 +20,35 @@ bool valid_key_size(uint32_t bits) {
     return bits == 128 || bits == 192 || bits == 256;
 }
 
-// Generation's GCM rule: every GCM block mode (or no block mode at all)
-// needs one KM_TAG_MIN_MAC_LENGTH of 96 to 128 bits in whole bytes.
-void check_min_mac_length(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
+// The family's vet: every AES key is TEE_TYPE_AES; generation (not import)
+// has the GCM rule: every GCM block mode (or no block mode at all) needs
+// one KM_TAG_MIN_MAC_LENGTH of 96 to 128 bits in whole bytes.
+TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating, uint32_t *tee_type, int32_t *error,
+                   const char *func) {
+    *tee_type = TEE_TYPE_AES;
+    if (!generating)
+        return TEE_SUCCESS;
     bool wanted = !key_param_set_has_tag(params, KM_TAG_BLOCK_MODE);
     for (uint32_t i = 0; params->params && i < params->length; ++i)
         if (params->params[i].tag == KM_TAG_BLOCK_MODE && params->params[i].enumerated == KM_MODE_GCM)
             wanted = true;
     if (!wanted)
-        return;
+        return TEE_SUCCESS;
     const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
     if (!min_mac) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH");
         *error = KM_ERROR_MISSING_MIN_MAC_LENGTH;
-        return;
+        return TEE_SUCCESS;
     }
     const uint32_t bits = min_mac->integer;
     if (bits < 96 || bits > 128 || bits % 8 != 0) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d", static_cast<int>(bits));
         *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
     }
+    return TEE_SUCCESS;
 }
+
+constexpr secret_key_family_t kAesKeys{.label = "AES", .words = 1, .valid = valid_key_size, .vet = vet_aes};
 
 // The TEE algorithm and nonce length of a block mode, and whether it takes PKCS#7.
 struct aes_mode_t {
@@ -164,61 +171,12 @@ bool hold_back_buffer(uint8_t **buf, uint32_t len, int32_t *error, const char *f
 
 TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
-                             [&](heap_buf *buf, TEE_Result *res) {
-                                 const key_param_t *size = provider_key_size(params, error, "aes_generate_key");
-                                 if (!size)
-                                     return false;
-                                 const uint32_t key_size = size->integer;
-                                 if (!valid_key_size(key_size)) {
-                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__,
-                                                 "Invalid AES key size %d", static_cast<int>(key_size));
-                                     *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                                     return false;
-                                 }
-                                 check_min_mac_length(params, error, "aes_generate_key");
-                                 if (*error)
-                                     return false;
-
-                                 const uint32_t key_bytes = key_size / 8;
-                                 if (!buf->alloc(kKeyDataHeader + key_bytes)) {
-                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_generate_key", __LINE__, "Out of memory");
-                                     *res = TEE_ERROR_OUT_OF_MEMORY;
-                                     return false;
-                                 }
-                                 byte_writer w(buf->get(), buf->len());
-                                 uint8_t *key = nullptr;
-                                 if (!w.write_u32(key_size) || !w.reserve(key_bytes, &key)) {
-                                     *res = TEE_ERROR_GENERIC;
-                                     return false;
-                                 }
-                                 *res = provider_secret_key(TEE_TYPE_AES, key_size, key, error, "aes_generate_key");
-                                 if (*res != TEE_SUCCESS || *error)
-                                     return false;
-                                 return true;
-                             });
+    return provider_generate_secret(kAesKeys, params, key_data, key_data_len, error);
 }
 
 TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_key_slot(params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
-                             [&](heap_buf *buf, TEE_Result *res) {
-                                 uint32_t guessed = 0;
-                                 if (!provider_raw_key_size(params, material_len, kKeyDataHeader, valid_key_size, "AES",
-                                                            &guessed, res, error, "aes_import_key"))
-                                     return false;
-                                 if (!buf->alloc(kKeyDataHeader + material_len)) {
-                                     KM_TRACE_AT(TEE_TRACE_ERROR, "aes_import_key", __LINE__, "Out of memory");
-                                     *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-                                     return false;
-                                 }
-                                 byte_writer w(buf->get(), buf->len());
-                                 if (!w.write_u32(guessed) || !w.write_bytes(material, material_len)) {
-                                     *res = TEE_ERROR_GENERIC;
-                                     return false;
-                                 }
-                                 return true;
-                             });
+    return provider_import_secret(kAesKeys, params, material, material_len, key_data, key_data_len, error);
 }
 
 TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

@@ -173,6 +173,73 @@ TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, 
     return TEE_SUCCESS;
 }
 
+TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t count, const uint8_t *body,
+                             uint32_t body_len, int32_t oom_error, int32_t *error, const char *func) {
+    const uint32_t header = 4 * count;
+    if (body_len > UINT32_MAX - header || !buf->alloc(header + body_len)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        if (oom_error == KM_ERROR_OK)
+            return TEE_ERROR_OUT_OF_MEMORY;
+        *error = oom_error;
+        return TEE_SUCCESS;
+    }
+    byte_writer w(buf->get(), buf->len());
+    for (uint32_t i = 0; i < count; ++i)
+        if (!w.write_u32(words[i], func))
+            return TEE_ERROR_GENERIC;
+    if (body && !w.write_bytes(body, body_len, func))
+        return TEE_ERROR_GENERIC;
+    return TEE_SUCCESS;
+}
+
+TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                    uint8_t **key_data, uint32_t *key_data_len, int32_t *error, const char *func) {
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
+        [&](heap_buf *buf, TEE_Result *res) {
+            const key_param_t *size = provider_key_size(params, error, func);
+            if (!size)
+                return false;
+            const uint32_t bits = size->integer;
+            if (!family.valid(bits)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", family.label,
+                            static_cast<int>(bits));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            uint32_t words[2] = {bits, 0};
+            *res = family.vet(params, bits, true, &words[1], error, func);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = provider_key_data(buf, words, family.words, nullptr, bits / 8, KM_ERROR_OK, error, func);
+            if (*res != TEE_SUCCESS)
+                return false;
+            *res = provider_secret_key(words[1], bits, buf->get() + 4 * family.words, error, func);
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        },
+        func);
+}
+
+TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                  const uint8_t *material, uint32_t material_len, uint8_t **key_data,
+                                  uint32_t *key_data_len, int32_t *error, const char *func) {
+    return provider_key_slot(
+        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
+        [&](heap_buf *buf, TEE_Result *res) {
+            uint32_t words[2] = {0, 0};
+            if (!provider_raw_key_size(params, material_len, 4 * family.words, family.valid, family.label, &words[0],
+                                       res, error, func))
+                return false;
+            *res = family.vet(params, words[0], false, &words[1], error, func);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = provider_key_data(buf, words, family.words, material, material_len,
+                                     KM_ERROR_MEMORY_ALLOCATION_FAILED, error, func);
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        },
+        func);
+}
+
 bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
                            bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
                            const char *func) {

@@ -100,38 +100,23 @@ TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data
 
 TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                          uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-    do {
-        byte_reader r(material, material_len);
-        ec_values_t v{};
-        if (!read_values(&r, &v, __func__)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        // Bytes after the private value are not kept.
-        const uint32_t consumed = material_len - r.remaining();
-        res = out.start(params, KM_ORIGIN_IMPORTED);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        res = provider_check_key_size(params, v.key_size, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (!supported_size(v.key_size, __func__)) {
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        if (!buf.alloc(consumed)) {
-            KM_ERR("Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
-        }
-        TEE_MemMove(buf.get(), material, consumed);
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+    ec_values_t v{};
+    return provider_import_slot(
+        params, material, material_len, key_data, key_data_len, error,
+        [&](byte_reader *r) { return read_values(r, &v, "ec_import_key"); },
+        [&](heap_buf *buf, TEE_Result *res, uint32_t consumed) {
+            *res = provider_check_key_size(params, v.key_size, error, "ec_import_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            if (!supported_size(v.key_size, "ec_import_key")) {
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            // The key data is the material as read: bytes after the private value are not kept.
+            *res = provider_key_data(buf, nullptr, 0, material, consumed, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
+                                     "ec_import_key");
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        });
 }
 
 TEE_Result ec_export_key(const uint8_t *key_data, uint32_t key_data_len, uint8_t *out, uint32_t *out_len,

@@ -28,16 +28,14 @@ constexpr hmac_digest_t kDigestTable[] = {
     {KM_DIGEST_SHA_2_384, TEE_TYPE_HMAC_SHA384, 256, 1024, 384, TEE_ALG_HMAC_SHA384},
     {KM_DIGEST_SHA_2_512, TEE_TYPE_HMAC_SHA512, 256, 1024, 512, TEE_ALG_HMAC_SHA512}};
 
-constexpr uint32_t kKeyDataHeader = 8; // key size and key type words
-
 bool valid_bit_length(uint32_t bits) {
     return bits >= 64 && bits % 8 == 0;
 }
 
-// The minimum MAC length and digest rules shared by generation and import;
-// on success *entry is the digest's row.
-TEE_Result check_mac_length_and_digest(const keymaster_key_param_set_t *params, uint32_t key_size,
-                                       const hmac_digest_t **entry, int32_t *error, const char *func) {
+// The family's vet, the same for generation and import: the minimum MAC
+// length and digest rules; the digest's row gives the TEE key type.
+TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, uint32_t *tee_type, int32_t *error,
+                    const char *func) {
     const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
     if (!min_mac) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH or specified");
@@ -75,27 +73,13 @@ TEE_Result check_mac_length_and_digest(const keymaster_key_param_set_t *params, 
         *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
         return TEE_SUCCESS;
     }
-    *entry = row;
+    *tee_type = row->key_type;
     return TEE_SUCCESS;
 }
+
+constexpr secret_key_family_t kHmacKeys{.label = "hmac", .words = 2, .valid = valid_bit_length, .vet = vet_hmac};
 
 // Starts key data: allocates header + key_bytes and writes the two header words.
-TEE_Result start_key_data(heap_buf *buf, uint32_t key_size, uint32_t key_type, uint32_t key_bytes, int32_t oom_error,
-                          int32_t *error, const char *func) {
-    if (!buf->alloc(kKeyDataHeader + key_bytes)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-        if (oom_error != 0) {
-            *error = oom_error;
-            return TEE_SUCCESS;
-        }
-        return TEE_ERROR_OUT_OF_MEMORY;
-    }
-    byte_writer w(buf->get(), buf->len());
-    if (!w.write_u32(key_size, func) || !w.write_u32(key_type, func))
-        return TEE_ERROR_GENERIC;
-    return TEE_SUCCESS;
-}
-
 } // namespace
 
 uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
@@ -107,54 +91,12 @@ uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
 
 TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                              int32_t *error) {
-    return provider_key_slot(
-        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = provider_key_size(params, error, "hmac_generate_key");
-            if (!size)
-                return false;
-            const uint32_t key_size = size->integer;
-            if (!valid_bit_length(key_size)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "hmac_generate_key", __LINE__, "Invalid hmac key size %d",
-                            static_cast<int>(key_size));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            const hmac_digest_t *row = nullptr;
-            *res = check_mac_length_and_digest(params, key_size, &row, error, "hmac_generate_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-
-            const uint32_t key_bytes = key_size / 8;
-            *res = start_key_data(buf, key_size, row->key_type, key_bytes, 0, error, "hmac_generate_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            *res =
-                provider_secret_key(row->key_type, key_size, buf->get() + kKeyDataHeader, error, "hmac_generate_key");
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            return true;
-        });
+    return provider_generate_secret(kHmacKeys, params, key_data, key_data_len, error);
 }
 
 TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                            uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_key_slot(params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
-                             [&](heap_buf *buf, TEE_Result *res) {
-                                 uint32_t guessed = 0;
-                                 if (!provider_raw_key_size(params, material_len, kKeyDataHeader, valid_bit_length,
-                                                            "hmac", &guessed, res, error, "hmac_import_key"))
-                                     return false;
-                                 const hmac_digest_t *row = nullptr;
-                                 *res = check_mac_length_and_digest(params, guessed, &row, error, "hmac_import_key");
-                                 if (*res != TEE_SUCCESS || *error)
-                                     return false;
-                                 *res = start_key_data(buf, guessed, row->key_type, material_len,
-                                                       KM_ERROR_MEMORY_ALLOCATION_FAILED, error, "hmac_import_key");
-                                 if (*res != TEE_SUCCESS || *error)
-                                     return false;
-                                 TEE_MemMove(buf->get() + kKeyDataHeader, material, material_len);
-                                 return true;
-                             });
+    return provider_import_secret(kHmacKeys, params, material, material_len, key_data, key_data_len, error);
 }
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

@@ -110,6 +110,34 @@ TEE_Result generate_pair(uint32_t key_size, uint64_t exponent, object_guard *obj
     return res;
 }
 
+// Import's exponent rule: e must fit the tag's 64 bits, whether the tag is
+// given (and then agrees with e's bytes) or derived from e.
+TEE_Result import_exponent(keymaster_key_param_set_t *params, const components_t &c, int32_t *error) {
+    const uint32_t e_len = c.len[1];
+    if (e_len > 8) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_import_key", __LINE__, "Public exponent mismatch");
+        *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+        return TEE_SUCCESS;
+    }
+    const key_param_t *exponent = key_param_set_find_unique(params, KM_TAG_RSA_PUBLIC_EXPONENT);
+    if (exponent) {
+        uint8_t e[8];
+        put_u64be(e, exponent->long_integer);
+        if (e_len && TEE_MemCompare(e + 8 - e_len, c.data[1], e_len) != 0) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_import_key", __LINE__, "Public exponent mismatch");
+            *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
+        }
+        return TEE_SUCCESS;
+    }
+    uint64_t e_value = 0;
+    for (uint32_t i = 0; i < e_len; ++i)
+        e_value = e_value << 8 | c.data[1][i];
+    TEE_Result res = key_param_set_add(params, key_param_long(KM_TAG_RSA_PUBLIC_EXPONENT, e_value));
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_import_key", __LINE__, "Out of memory");
+    return res;
+}
+
 } // namespace
 
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
@@ -132,65 +160,29 @@ TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_dat
 
 TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    key_output out(key_data, key_data_len, error);
-    heap_buf &buf = out.buf;
-    TEE_Result res = TEE_SUCCESS;
-    bool done = false;
-    do {
-        byte_reader r(material, material_len);
-        components_t c{};
-        if (!read_components(&r, &c, __func__)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        const uint32_t consumed = material_len - r.remaining();
-        res = out.start(params, KM_ORIGIN_IMPORTED);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        const uint64_t guessed64 = uint64_t{c.len[0]} * 8;
-        const uint32_t guessed = guessed64 > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(guessed64);
-        res = provider_check_key_size(params, guessed, error);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        if (!valid_key_size(guessed)) {
-            KM_ERR("Invalid RSA key size %d", static_cast<int>(guessed));
-            *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-            break;
-        }
-        // The exponent must fit the tag's 64 bits, whether the tag is given or derived.
-        const uint32_t e_len = c.len[1];
-        if (e_len > 8) {
-            KM_ERR("Public exponent mismatch");
-            *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
-            break;
-        }
-        uint64_t e_value = 0;
-        for (uint32_t i = 0; i < e_len; ++i)
-            e_value = e_value << 8 | c.data[1][i];
-        const key_param_t *exponent = key_param_set_find_unique(params, KM_TAG_RSA_PUBLIC_EXPONENT);
-        if (exponent) {
-            uint8_t e[8];
-            put_u64be(e, exponent->long_integer);
-            if (e_len && TEE_MemCompare(e + 8 - e_len, c.data[1], e_len) != 0) {
-                KM_ERR("Public exponent mismatch");
-                *error = KM_ERROR_IMPORT_PARAMETER_MISMATCH;
-                break;
+    components_t c{};
+    return provider_import_slot(
+        params, material, material_len, key_data, key_data_len, error,
+        [&](byte_reader *r) { return read_components(r, &c, "rsa_import_key"); },
+        [&](heap_buf *buf, TEE_Result *res, uint32_t consumed) {
+            const uint64_t guessed64 = uint64_t{c.len[0]} * 8;
+            const uint32_t guessed = guessed64 > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(guessed64);
+            *res = provider_check_key_size(params, guessed, error, "rsa_import_key");
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            if (!valid_key_size(guessed)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_import_key", __LINE__, "Invalid RSA key size %d",
+                            static_cast<int>(guessed));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
             }
-        } else if ((res = key_param_set_add(params, key_param_long(KM_TAG_RSA_PUBLIC_EXPONENT, e_value))) !=
-                   TEE_SUCCESS) {
-            KM_ERR("Out of memory");
-            break;
-        }
-        if (consumed > UINT32_MAX - 4 || !buf.alloc(4 + consumed)) {
-            KM_ERR("Out of memory");
-            *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
-        }
-        put_u32le(buf.get(), guessed);
-        TEE_MemMove(buf.get() + 4, material, consumed);
-        done = true;
-    } while (false);
-    return out.settle(res, done);
+            *res = import_exponent(params, c, error);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = provider_key_data(buf, &guessed, 1, material, consumed, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
+                                     "rsa_import_key");
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        });
 }
 
 TEE_Result rsa_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,

@@ -257,6 +257,18 @@ TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin,
                              const char *func = __builtin_FUNCTION());
 
 /*
+ * provider_import_slot - the frame of an import whose material has a
+ * layout of its own: the outputs cleared, then parse(reader) over the
+ * material, which logs and returns false when it is cut short
+ * (TEE_ERROR_GENERIC), and only then the origin and steps(buf, res,
+ * consumed) as in provider_key_slot; consumed is what the parse read.
+ */
+template <typename Parse, typename Steps>
+TEE_Result provider_import_slot(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                                uint8_t **key_data, uint32_t *key_data_len, int32_t *error, Parse parse, Steps steps,
+                                const char *func = __builtin_FUNCTION());
+
+/*
  * provider_key_size - the single KM_TAG_KEY_SIZE a generation needs: its
  * parameter, or null with "No or too many KM_TAG_KEY_SIZE or specified"
  * logged in func's name and *error -38.
@@ -284,6 +296,17 @@ TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, cons
 TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func);
 
 /*
+ * provider_key_data - lays key data out in buf: count u32 words
+ * (little-endian), then body_len bytes copied from body or, with body
+ * null, left zero for the caller to fill at buf->get() + 4 * count. A
+ * buffer that cannot be had is "Out of memory" logged in func's name and
+ * *error oom_error with TEE_SUCCESS, or TEE_ERROR_OUT_OF_MEMORY when
+ * oom_error is 0.
+ */
+TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t count, const uint8_t *body,
+                             uint32_t body_len, int32_t oom_error, int32_t *error, const char *func);
+
+/*
  * provider_raw_key_size - the size in bits of raw key material of
  * material_len bytes, to be stored after `header` bytes: a length whose
  * bits overflow, or that valid() refuses, is "Invalid <label> key size %d"
@@ -304,6 +327,38 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
                                    const char *func = __builtin_FUNCTION());
 
 /*
+ * secret_key_family_t - what the key slots of a raw secret-key family
+ * (AES, HMAC) differ in. Key data: `words` u32s (the key size, then the
+ * TEE key type when words is 2), then the key bytes. label names the
+ * family in "Invalid %s key size %d"; valid() takes its sizes; vet()
+ * checks the other parameters for a key of bits (for generation or
+ * import) and gives the TEE object type, setting *error or returning the
+ * TEE's result when the parameters will not do.
+ */
+struct secret_key_family_t {
+    const char *label;
+    uint32_t words;
+    bool (*valid)(uint32_t bits);
+    TEE_Result (*vet)(keymaster_key_param_set_t *params, uint32_t bits, bool generating, uint32_t *tee_type,
+                      int32_t *error, const char *func);
+};
+
+/*
+ * provider_generate_secret / provider_import_secret - the generate and
+ * import slots of a secret-key family, within provider_key_slot: the
+ * size from KM_TAG_KEY_SIZE (generation) or from the material (import,
+ * provider_raw_key_size), vet(), then the key data with a fresh key from
+ * the TEE or the material. No memory is TEE_ERROR_OUT_OF_MEMORY in
+ * generation and *error -41 in import. Logged in func's name.
+ */
+TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                    uint8_t **key_data, uint32_t *key_data_len, int32_t *error,
+                                    const char *func = __builtin_FUNCTION());
+TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                  const uint8_t *material, uint32_t material_len, uint8_t **key_data,
+                                  uint32_t *key_data_len, int32_t *error, const char *func = __builtin_FUNCTION());
+
+/*
  * key_output - the key data a provider's generate or import slot builds.
  * It clears the slot's outputs and error when made; settle() is the slot's
  * one exit: on success the buffer becomes the key data (the caller frees
@@ -321,6 +376,13 @@ class key_output {
     /* start - refuses a caller-supplied KM_TAG_ORIGIN and records origin (provider_set_origin). */
     TEE_Result start(keymaster_key_param_set_t *params, uint32_t origin, const char *func = __builtin_FUNCTION()) {
         return provider_set_origin(params, origin, error_, func);
+    }
+    /* run - start, then steps(&buf, &res) if that went through, then settle. */
+    template <typename Steps>
+    TEE_Result run(keymaster_key_param_set_t *params, uint32_t origin, Steps steps, const char *func) {
+        TEE_Result res = start(params, origin, func);
+        const bool done = res == TEE_SUCCESS && *error_ == KM_ERROR_OK && steps(&buf, &res);
+        return settle(res, done);
     }
     TEE_Result settle(TEE_Result res, bool done) {
         settle_error(res, done, error_);
@@ -342,9 +404,20 @@ template <typename Steps>
 TEE_Result provider_key_slot(keymaster_key_param_set_t *params, uint32_t origin, uint8_t **key_data,
                              uint32_t *key_data_len, int32_t *error, Steps steps, const char *func) {
     key_output out(key_data, key_data_len, error);
-    TEE_Result res = out.start(params, origin, func);
-    const bool done = res == TEE_SUCCESS && *error == KM_ERROR_OK && steps(&out.buf, &res);
-    return out.settle(res, done);
+    return out.run(params, origin, steps, func);
+}
+
+template <typename Parse, typename Steps>
+TEE_Result provider_import_slot(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                                uint8_t **key_data, uint32_t *key_data_len, int32_t *error, Parse parse, Steps steps,
+                                const char *func) {
+    key_output out(key_data, key_data_len, error);
+    byte_reader r(material, material_len);
+    if (!parse(&r))
+        return out.settle(TEE_ERROR_GENERIC, false);
+    const uint32_t consumed = material_len - r.remaining();
+    return out.run(
+        params, KM_ORIGIN_IMPORTED, [&](heap_buf *buf, TEE_Result *res) { return steps(buf, res, consumed); }, func);
 }
 
 /* export_key_unsupported - the export slot of providers without an export format. */
