@@ -148,16 +148,10 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
 
 TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func) {
     object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(type, key_size, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
+    TEE_Result res =
+        key_object(type, key_size, nullptr, 0, obj.out(), key_fill::generate, tee_call_texts::standard, func, __LINE__);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_GenerateKey(obj.get(), key_size, nullptr, 0);
-    if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "GenerateKey failed with 0x%08x\n", res);
-        return res;
-    }
     const uint32_t key_bytes = key_size / 8;
     uint32_t got = key_bytes;
     res = TEE_GetObjectBufferAttribute(obj.get(), TEE_ATTR_SECRET_VALUE, dest, &got);

@@ -61,17 +61,10 @@ bool supported_size(uint32_t key_size, const char *func) {
 
 // A fresh key pair on the curve of key_size.
 TEE_Result generate_pair(const ec_curve_t &c, object_guard *obj) {
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_ECDSA_KEYPAIR, c.key_size, obj->out());
-    if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
     TEE_Attribute curve{};
     TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, c.curve, 0);
-    res = TEE_GenerateKey(obj->get(), c.key_size, &curve, 1);
-    if (res != TEE_SUCCESS)
-        KM_TRACE_AT(TEE_TRACE_ERROR, "ec_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", res);
-    return res;
+    return key_object(TEE_TYPE_ECDSA_KEYPAIR, c.key_size, &curve, 1, obj->out(), key_fill::generate,
+                      tee_call_texts::standard, "ec_generate_key", __LINE__);
 }
 
 } // namespace
@@ -160,18 +153,9 @@ TEE_Result ec_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, T
     for (uint32_t i = 0; i < kValues; ++i)
         TEE_InitRefAttribute(&attrs[i], kAttributeIds[i], v.data[i], v.len[i]);
     TEE_InitValueAttribute(&attrs[kValues], TEE_ATTR_ECC_CURVE, c->curve, 0);
-    object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_ECDSA_KEYPAIR, v.key_size, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+    TEE_Result res = key_object(TEE_TYPE_ECDSA_KEYPAIR, v.key_size, attrs, kValues + 1, object);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_PopulateTransientObject(obj.get(), attrs, kValues + 1);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *object = obj.release();
     if (key_size)
         *key_size = v.key_size;
     *error = KM_ERROR_OK;
@@ -210,12 +194,9 @@ bool start_message(ec_operation_t *op, int32_t *error, const char *func) {
     for (const ec_digest_t &d : kDigests) {
         if (d.digest != op->digest)
             continue;
-        TEE_Result res = TEE_AllocateOperation(&op->digest_operation, d.algorithm, TEE_MODE_DIGEST, 0);
-        if (res != TEE_SUCCESS) {
-            op->digest_operation = nullptr;
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
+        if (keyed_operation(&op->digest_operation, d.algorithm, TEE_MODE_DIGEST, 0, TEE_HANDLE_NULL,
+                            tee_call_texts::standard, func, __LINE__) != TEE_SUCCESS)
             return false;
-        }
         room = d.length;
         op->message_len = room;
     }

@@ -25,21 +25,7 @@ constexpr char kKskObjectId[] = "Keymaster KSK"; // stored with its zero byte: 1
 
 // make_hmac_sha256_key - a 256-bit HMAC-SHA-256 object holding secret.
 TEE_Result make_hmac_sha256_key(const uint8_t *secret, TEE_ObjectHandle *out) {
-    object_guard obj;
-    TEE_Attribute attr{};
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_HMAC_SHA256, 256, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, secret, kKskSize);
-    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *out = obj.release();
-    return TEE_SUCCESS;
+    return secret_key_object(TEE_TYPE_HMAC_SHA256, 8 * kKskSize, secret, out);
 }
 
 // The KSK named by a blob's protection byte; logs and fails like the readers need.
@@ -64,16 +50,9 @@ TEE_Result select_ksk(uint8_t kind, TEE_ObjectHandle *ksk, bool *unknown, const 
 
 // An AES-256-GCM operation under kk with the blob's nonce and a 128-bit tag.
 TEE_Result start_gcm(TEE_ObjectHandle kk, uint32_t mode, const uint8_t *nonce, operation_guard *op) {
-    TEE_Result res = TEE_AllocateOperation(op->out(), TEE_ALG_AES_GCM, mode, 256);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateOperation failed with 0x%08x\n", res);
+    TEE_Result res = keyed_operation(op->out(), TEE_ALG_AES_GCM, mode, 256, kk);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_SetOperationKey(op->get(), kk);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("SetOperationKey failed with 0x%08x\n", res);
-        return res;
-    }
     res = TEE_AEInit(op->get(), nonce, kBlobNonceSize, kBlobTagSize * 8, 0, 0);
     if (res != TEE_SUCCESS)
         KM_ERR("AEInit failed with 0x%08x\n", res);
@@ -123,16 +102,9 @@ TEE_Result key_store_init_rpmb_ksk() {
     if (res == TEE_ERROR_ITEM_NOT_FOUND) {
         object_guard ksk;
         uint32_t len = sizeof secret;
-        res = TEE_AllocateTransientObject(TEE_TYPE_HMAC_SHA256, 256, ksk.out());
-        if (res != TEE_SUCCESS) {
-            KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+        res = key_object(TEE_TYPE_HMAC_SHA256, 256, nullptr, 0, ksk.out(), key_fill::generate);
+        if (res != TEE_SUCCESS)
             return res;
-        }
-        res = TEE_GenerateKey(ksk.get(), 256, nullptr, 0);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("GenerateKey failed with 0x%08x\n", res);
-            return res;
-        }
         res = TEE_GetObjectBufferAttribute(ksk.get(), TEE_ATTR_SECRET_VALUE, secret, &len);
         if (res != TEE_SUCCESS) {
             KM_ERR("GetObjectBufferAttribute failed with 0x%08x\n", res);
@@ -236,19 +208,9 @@ TEE_Result TEE_DeriveKK(TEE_ObjectHandle ksk, const uint8_t *input, TEE_ObjectHa
     TEE_OperationHandle *slot = ksk == rpmb_ksk ? &rpmb_ksk_mac : &derived_ksk_mac;
     TEE_Result res = TEE_SUCCESS;
     if (!*slot) {
-        res = TEE_AllocateOperation(slot, TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("AllocateOperation failed with 0x%08x\n", res);
-            *slot = nullptr;
+        res = keyed_operation(slot, TEE_ALG_HMAC_SHA256, TEE_MODE_MAC, 256, ksk);
+        if (res != TEE_SUCCESS)
             return res;
-        }
-        res = TEE_SetOperationKey(*slot, ksk);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("SetOperationKey failed with 0x%08x\n", res);
-            TEE_FreeOperation(*slot);
-            *slot = nullptr;
-            return res;
-        }
     }
     TEE_MACInit(*slot, nullptr, 0);
     res = TEE_MACComputeFinal(*slot, input, kBlobDeriveSize, mac, &mac_len);
@@ -260,21 +222,7 @@ TEE_Result TEE_DeriveKK(TEE_ObjectHandle ksk, const uint8_t *input, TEE_ObjectHa
         KM_ERR("Wrong MAC length, expected %dB, got %dB\n", static_cast<int>(sizeof mac), static_cast<int>(mac_len));
         return TEE_ERROR_BAD_PARAMETERS;
     }
-    object_guard key;
-    TEE_Attribute attr{};
-    res = TEE_AllocateTransientObject(TEE_TYPE_AES, 256, key.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, mac, sizeof mac);
-    res = TEE_PopulateTransientObject(key.get(), &attr, 1);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *kk = key.release();
-    return TEE_SUCCESS;
+    return secret_key_object(TEE_TYPE_AES, 256, mac, kk);
 }
 
 TEE_Result save_key(const uint8_t *key_data, uint32_t key_data_len, const keymaster_key_param_set_t *params,

@@ -97,17 +97,10 @@ bool generation_params(const keymaster_key_param_set_t *params, uint64_t *expone
 TEE_Result generate_pair(uint32_t key_size, uint64_t exponent, object_guard *obj) {
     uint8_t e[8] = {};
     put_u64be(e, exponent);
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_RSA_KEYPAIR, key_size, obj->out());
-    if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "AllocateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
     TEE_Attribute attr{};
     TEE_InitRefAttribute(&attr, TEE_ATTR_RSA_PUBLIC_EXPONENT, e, sizeof e);
-    res = TEE_GenerateKey(obj->get(), key_size, &attr, 1);
-    if (res != TEE_SUCCESS)
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "GenerateKey failed with 0x%08x\n", res);
-    return res;
+    return key_object(TEE_TYPE_RSA_KEYPAIR, key_size, &attr, 1, obj->out(), key_fill::generate,
+                      tee_call_texts::standard, "rsa_generate_key", __LINE__);
 }
 
 // Import's exponent rule: e must fit the tag's 64 bits, whether the tag is
@@ -198,18 +191,9 @@ TEE_Result rsa_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, 
     TEE_Attribute attrs[kRsaComponents] = {};
     for (uint32_t i = 0; i < kRsaComponents; ++i)
         TEE_InitRefAttribute(&attrs[i], kAttributeIds[i], c.data[i], c.len[i]);
-    object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_RSA_KEYPAIR, bits, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("AllocateTransientObject failed with 0x%08x\n", res);
+    TEE_Result res = key_object(TEE_TYPE_RSA_KEYPAIR, bits, attrs, kRsaComponents, object);
+    if (res != TEE_SUCCESS)
         return res;
-    }
-    res = TEE_PopulateTransientObject(obj.get(), attrs, kRsaComponents);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("PopulateTransientObject failed with 0x%08x\n", res);
-        return res;
-    }
-    *object = obj.release();
     if (key_size)
         *key_size = bits;
     *error = KM_ERROR_OK;
@@ -356,14 +340,9 @@ operation_t *rsa_signature_create(const uint8_t *key_data, uint32_t key_data_len
     uint32_t algorithm = 0;
     uint32_t mode = 0;
     bool ok = signature_algorithm(op, signing, &row, &algorithm, &mode, error, func);
-    if (ok && row) {
-        TEE_Result res = TEE_AllocateOperation(&op->digest_operation, row->hash, TEE_MODE_DIGEST, 0);
-        if (res != TEE_SUCCESS) {
-            op->digest_operation = nullptr;
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "AllocateOperation failed with 0x%08x\n", res);
-            ok = false;
-        }
-    }
+    if (ok && row)
+        ok = keyed_operation(&op->digest_operation, row->hash, TEE_MODE_DIGEST, 0, TEE_HANDLE_NULL,
+                             tee_call_texts::standard, func, __LINE__) == TEE_SUCCESS;
     return rsa_record_finish(op, ok, algorithm, mode, func);
 }
 

@@ -275,12 +275,10 @@ TEE_Result get_fresh_fid(uint32_t *fid) {
 TEE_Result do_digest_with_sha(uint32_t algorithm, const uint8_t *message, uint32_t message_len, uint8_t *digest,
                               uint32_t *digest_len) {
     operation_guard op;
-    TEE_Result res = TEE_AllocateOperation(op.out(), algorithm, TEE_MODE_DIGEST, 0);
-    if (res != TEE_SUCCESS) {
-        *op.out() = TEE_HANDLE_NULL;
-        KM_ERR("TEE_AllocateOperation failed: %08x\n", res);
+    TEE_Result res =
+        keyed_operation(op.out(), algorithm, TEE_MODE_DIGEST, 0, TEE_HANDLE_NULL, tee_call_texts::prefixed);
+    if (res != TEE_SUCCESS)
         return res;
-    }
     TEE_DigestUpdate(op.get(), message, message_len);
     res = TEE_DigestDoFinal(op.get(), nullptr, 0, digest, digest_len);
     if (res != TEE_SUCCESS)

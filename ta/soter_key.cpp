@@ -381,12 +381,6 @@ void free_soter_prop_set(soter_prop_set *props) {
 
 TEE_ObjectHandle convert_key_to_object(const soter_key_pair *key, uint32_t *key_size) {
     *key_size = kAttkBits;
-    object_guard obj;
-    TEE_Result res = TEE_AllocateTransientObject(TEE_TYPE_RSA_KEYPAIR, kAttkBits, obj.out());
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_AllocateTransientObject failed: %08x\n", res);
-        return nullptr;
-    }
     struct attr_source {
         uint32_t id;
         const vlb *value;
@@ -405,12 +399,9 @@ TEE_ObjectHandle convert_key_to_object(const soter_key_pair *key, uint32_t *key_
     uint32_t count = key->prime1.len != 0 ? 8 : 3;
     for (uint32_t i = 0; i < count; ++i)
         TEE_InitRefAttribute(&attrs[i], sources[i].id, sources[i].value->buf, sources[i].value->len);
-    res = TEE_PopulateTransientObject(obj.get(), attrs, count);
-    if (res != TEE_SUCCESS) {
-        KM_ERR("TEE_PopulateTransientObject failed: %08x\n", res);
-        return nullptr;
-    }
-    return obj.release();
+    TEE_ObjectHandle obj = nullptr;
+    key_object(TEE_TYPE_RSA_KEYPAIR, kAttkBits, attrs, count, &obj, key_fill::populate, tee_call_texts::prefixed);
+    return obj;
 }
 
 TEE_ObjectHandle resolve_key_from_data(const uint8_t *key_data, uint32_t key_data_len, uint32_t *key_size) {

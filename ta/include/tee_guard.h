@@ -48,64 +48,81 @@ using persistent_guard = tee_handle_guard<TEE_ObjectHandle, TEE_CloseObject>;
 /* operation_guard - an operation, freed. */
 using operation_guard = tee_handle_guard<TEE_OperationHandle, TEE_FreeOperation>;
 
+/* Which log text keyed_operation and key_object use for a failed TEE call X. */
+enum class tee_call_texts : uint8_t {
+    standard, // "X failed with 0x%08x\n"
+    prefixed, // "TEE_X failed: %08x\n"
+};
+
+/* tee_call_failed - logs the failure of the TEE call named `call` in the texts' form. */
+inline void tee_call_failed(tee_call_texts texts, const char *call, TEE_Result res, const char *func, int line) {
+    if (texts == tee_call_texts::prefixed)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "TEE_%s failed: %08x\n", call, res);
+    else
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "%s failed with 0x%08x\n", call, res);
+}
+
+/* How key_object fills its new object. */
+enum class key_fill : uint8_t {
+    populate, // with the given attributes (TEE_PopulateTransientObject)
+    generate, // with a fresh key, the attributes as generation parameters (TEE_GenerateKey)
+};
+
 /*
- * secret_key_object - a transient object of type and bits holding the
- * key bytes as its TEE_ATTR_SECRET_VALUE. TEE_SUCCESS with *object owned
- * by the caller; otherwise the failing call is logged in the caller's
- * name and its result returned, with *object null.
+ * key_object - a transient object of type and bits, filled as `fill`
+ * says. TEE_SUCCESS with *object owned by the caller; on failure *object
+ * is null, the failing call is logged in the caller's name and its result
+ * returned.
  */
-inline TEE_Result secret_key_object(uint32_t type, uint32_t bits, const uint8_t *key, TEE_ObjectHandle *object,
-                                    const char *func = __builtin_FUNCTION(), int line = __builtin_LINE()) {
+inline TEE_Result key_object(uint32_t type, uint32_t bits, const TEE_Attribute *attrs, uint32_t count,
+                             TEE_ObjectHandle *object, key_fill fill = key_fill::populate,
+                             tee_call_texts texts = tee_call_texts::standard, const char *func = __builtin_FUNCTION(),
+                             int line = __builtin_LINE()) {
     *object = nullptr;
-    TEE_Attribute attr{};
-    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
     object_guard obj;
     TEE_Result res = TEE_AllocateTransientObject(type, bits, obj.out());
     if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "AllocateTransientObject failed with 0x%08x\n", res);
+        tee_call_failed(texts, "AllocateTransientObject", res, func, line);
         return res;
     }
-    res = TEE_PopulateTransientObject(obj.get(), &attr, 1);
+    const bool generate = fill == key_fill::generate;
+    res = generate ? TEE_GenerateKey(obj.get(), bits, attrs, count)
+                   : TEE_PopulateTransientObject(obj.get(), attrs, count);
     if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "PopulateTransientObject failed with 0x%08x\n", res);
+        tee_call_failed(texts, generate ? "GenerateKey" : "PopulateTransientObject", res, func, line);
         return res;
     }
     *object = obj.release();
     return TEE_SUCCESS;
 }
 
-/* Which log texts keyed_operation uses for its two TEE calls. */
-enum class tee_call_texts : uint8_t {
-    standard, // "AllocateOperation failed with 0x%08x\n", "SetOperationKey failed with 0x%08x\n"
-    prefixed, // "TEE_AllocateOperation failed: %08x\n", "TEE_SetOperationKey failed: %08x\n"
-};
+/* secret_key_object - key_object with one TEE_ATTR_SECRET_VALUE of bits / 8 bytes of key. */
+inline TEE_Result secret_key_object(uint32_t type, uint32_t bits, const uint8_t *key, TEE_ObjectHandle *object,
+                                    const char *func = __builtin_FUNCTION(), int line = __builtin_LINE()) {
+    TEE_Attribute attr{};
+    TEE_InitRefAttribute(&attr, TEE_ATTR_SECRET_VALUE, key, bits / 8);
+    return key_object(type, bits, &attr, 1, object, key_fill::populate, tee_call_texts::standard, func, line);
+}
 
 /*
  * keyed_operation - allocates a TEE operation (algorithm, mode, maximum key
- * size) and sets key on it. TEE_SUCCESS with *op owned by the caller; on
+ * size) and sets key on it; with key null (a digest) no key is set. TEE_SUCCESS with *op owned by the caller; on
  * failure *op is null, the failing call is logged in the caller's name and
  * its result returned.
  */
 inline TEE_Result keyed_operation(TEE_OperationHandle *op, uint32_t algorithm, uint32_t mode, uint32_t max_key_size,
                                   TEE_ObjectHandle key, tee_call_texts texts = tee_call_texts::standard,
                                   const char *func = __builtin_FUNCTION(), int line = __builtin_LINE()) {
-    const bool prefixed = texts == tee_call_texts::prefixed;
     TEE_OperationHandle h = nullptr;
     *op = nullptr;
     TEE_Result res = TEE_AllocateOperation(&h, algorithm, mode, max_key_size);
     if (res != TEE_SUCCESS) {
-        if (prefixed)
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "TEE_AllocateOperation failed: %08x\n", res);
-        else
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "AllocateOperation failed with 0x%08x\n", res);
+        tee_call_failed(texts, "AllocateOperation", res, func, line);
         return res;
     }
-    res = TEE_SetOperationKey(h, key);
+    res = key ? TEE_SetOperationKey(h, key) : TEE_SUCCESS;
     if (res != TEE_SUCCESS) {
-        if (prefixed)
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "TEE_SetOperationKey failed: %08x\n", res);
-        else
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "SetOperationKey failed with 0x%08x\n", res);
+        tee_call_failed(texts, "SetOperationKey", res, func, line);
         TEE_FreeOperation(h);
         return res;
     }
