@@ -20,12 +20,10 @@ bool valid_key_size(uint32_t bits) {
     return bits == 128 || bits == 192 || bits == 256;
 }
 
-// The family's vet: every AES key is TEE_TYPE_AES; generation (not import)
-// has the GCM rule: every GCM block mode (or no block mode at all) needs
+// The family's vet: generation (not import) has the GCM rule: every GCM block mode (or no block mode at all) needs
 // one KM_TAG_MIN_MAC_LENGTH of 96 to 128 bits in whole bytes.
-TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating, uint32_t *tee_type, int32_t *error,
+TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating, uint32_t *, int32_t *error,
                    const char *func) {
-    *tee_type = TEE_TYPE_AES;
     if (!generating)
         return TEE_SUCCESS;
     bool wanted = !key_param_set_has_tag(params, KM_TAG_BLOCK_MODE);
@@ -48,7 +46,8 @@ TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating,
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kAesKeys{.label = "AES", .words = 1, .valid = valid_key_size, .vet = vet_aes};
+constexpr secret_key_family_t kAesKeys{
+    .label = "AES", .tee_type = TEE_TYPE_AES, .valid = valid_key_size, .vet = vet_aes};
 
 // The TEE algorithm and nonce length of a block mode, and whether it takes PKCS#7.
 struct aes_mode_t {
@@ -181,21 +180,7 @@ TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *mate
 
 TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
                                 uint32_t *key_size, int32_t *error) {
-    *object = nullptr;
-    if (key_size)
-        *key_size = 0;
-    byte_reader r(key_data, key_data_len);
-    uint32_t bits = 0;
-    const uint8_t *key = nullptr;
-    if (!r.read_u32(&bits) || !r.read_bytes(bits / 8, &key))
-        return TEE_ERROR_GENERIC;
-    TEE_Result res = secret_key_object(TEE_TYPE_AES, bits, key, object);
-    if (res != TEE_SUCCESS)
-        return res;
-    if (key_size)
-        *key_size = bits;
-    *error = KM_ERROR_OK;
-    return TEE_SUCCESS;
+    return provider_resolve_secret(kAesKeys, key_data, key_data_len, object, key_size, nullptr, error);
 }
 
 operation_t *aes_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,

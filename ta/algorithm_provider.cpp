@@ -146,6 +146,36 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
     return res;
 }
 
+TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t count, const uint8_t *body,
+                             uint32_t body_len, int32_t oom_error, int32_t *error, const char *func) {
+    const uint32_t header = 4 * count;
+    if (body_len > UINT32_MAX - header || !buf->alloc(header + body_len)) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+        if (oom_error == KM_ERROR_OK)
+            return TEE_ERROR_OUT_OF_MEMORY;
+        *error = oom_error;
+        return TEE_SUCCESS;
+    }
+    byte_writer w(buf->get(), buf->len());
+    for (uint32_t i = 0; i < count; ++i)
+        if (!w.write_u32(words[i], func))
+            return TEE_ERROR_GENERIC;
+    if (body && !w.write_bytes(body, body_len, func))
+        return TEE_ERROR_GENERIC;
+    return TEE_SUCCESS;
+}
+
+namespace {
+
+// The u32 words ahead of a secret key's bytes: its size, and its TEE type
+// when the family has none of its own.
+constexpr uint32_t header_words(const secret_key_family_t &family) {
+    return family.tee_type ? 1 : 2;
+}
+
+// A new key_size-bit secret of TEE object type `type`, written into dest
+// (key_size / 8 bytes). The TEE's result, or TEE_SUCCESS with *error -1000
+// when it hands back another length.
 TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func) {
     object_guard obj;
     TEE_Result res =
@@ -167,73 +197,11 @@ TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, 
     return TEE_SUCCESS;
 }
 
-TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t count, const uint8_t *body,
-                             uint32_t body_len, int32_t oom_error, int32_t *error, const char *func) {
-    const uint32_t header = 4 * count;
-    if (body_len > UINT32_MAX - header || !buf->alloc(header + body_len)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
-        if (oom_error == KM_ERROR_OK)
-            return TEE_ERROR_OUT_OF_MEMORY;
-        *error = oom_error;
-        return TEE_SUCCESS;
-    }
-    byte_writer w(buf->get(), buf->len());
-    for (uint32_t i = 0; i < count; ++i)
-        if (!w.write_u32(words[i], func))
-            return TEE_ERROR_GENERIC;
-    if (body && !w.write_bytes(body, body_len, func))
-        return TEE_ERROR_GENERIC;
-    return TEE_SUCCESS;
-}
-
-TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
-                                    uint8_t **key_data, uint32_t *key_data_len, int32_t *error, const char *func) {
-    return provider_key_slot(
-        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
-        [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = provider_key_size(params, error, func);
-            if (!size)
-                return false;
-            const uint32_t bits = size->integer;
-            if (!family.valid(bits)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", family.label,
-                            static_cast<int>(bits));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            uint32_t words[2] = {bits, 0};
-            *res = family.vet(params, bits, true, &words[1], error, func);
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            *res = provider_key_data(buf, words, family.words, nullptr, bits / 8, KM_ERROR_OK, error, func);
-            if (*res != TEE_SUCCESS)
-                return false;
-            *res = provider_secret_key(words[1], bits, buf->get() + 4 * family.words, error, func);
-            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
-        },
-        func);
-}
-
-TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
-                                  const uint8_t *material, uint32_t material_len, uint8_t **key_data,
-                                  uint32_t *key_data_len, int32_t *error, const char *func) {
-    return provider_key_slot(
-        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
-        [&](heap_buf *buf, TEE_Result *res) {
-            uint32_t words[2] = {0, 0};
-            if (!provider_raw_key_size(params, material_len, 4 * family.words, family.valid, family.label, &words[0],
-                                       res, error, func))
-                return false;
-            *res = family.vet(params, words[0], false, &words[1], error, func);
-            if (*res != TEE_SUCCESS || *error)
-                return false;
-            *res = provider_key_data(buf, words, family.words, material, material_len,
-                                     KM_ERROR_MEMORY_ALLOCATION_FAILED, error, func);
-            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
-        },
-        func);
-}
-
+// The size in bits of raw key material of material_len bytes, to be stored
+// after `header` bytes: a length whose bits overflow, or that valid()
+// refuses, is "Invalid <label> key size %d" with *error -6; a
+// KM_TAG_KEY_SIZE that disagrees is refused as provider_check_key_size
+// says. True, with *bits, when usable.
 bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
                            bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
                            const char *func) {
@@ -252,6 +220,81 @@ bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_
         return false;
     }
     return true;
+}
+
+} // namespace
+
+TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                    uint8_t **key_data, uint32_t *key_data_len, int32_t *error, const char *func) {
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
+        [&](heap_buf *buf, TEE_Result *res) {
+            const key_param_t *size = provider_key_size(params, error, func);
+            if (!size)
+                return false;
+            const uint32_t bits = size->integer;
+            if (!family.valid(bits)) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", family.label,
+                            static_cast<int>(bits));
+                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+                return false;
+            }
+            uint32_t words[2] = {bits, family.tee_type};
+            *res = family.vet(params, bits, true, &words[1], error, func);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = provider_key_data(buf, words, header_words(family), nullptr, bits / 8, KM_ERROR_OK, error, func);
+            if (*res != TEE_SUCCESS)
+                return false;
+            *res = provider_secret_key(words[1], bits, buf->get() + 4 * header_words(family), error, func);
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        },
+        func);
+}
+
+TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
+                                  const uint8_t *material, uint32_t material_len, uint8_t **key_data,
+                                  uint32_t *key_data_len, int32_t *error, const char *func) {
+    return provider_key_slot(
+        params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
+        [&](heap_buf *buf, TEE_Result *res) {
+            uint32_t words[2] = {0, family.tee_type};
+            if (!provider_raw_key_size(params, material_len, 4 * header_words(family), family.valid, family.label,
+                                       &words[0], res, error, func))
+                return false;
+            *res = family.vet(params, words[0], false, &words[1], error, func);
+            if (*res != TEE_SUCCESS || *error)
+                return false;
+            *res = provider_key_data(buf, words, header_words(family), material, material_len,
+                                     KM_ERROR_MEMORY_ALLOCATION_FAILED, error, func);
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        },
+        func);
+}
+
+TEE_Result provider_resolve_secret(const secret_key_family_t &family, const uint8_t *key_data, uint32_t key_data_len,
+                                   TEE_ObjectHandle *object, uint32_t *key_size, uint32_t *key_type, int32_t *error,
+                                   const char *func) {
+    *object = nullptr;
+    if (key_size)
+        *key_size = 0;
+    byte_reader r(key_data, key_data_len);
+    uint32_t words[2] = {0, family.tee_type};
+    const uint8_t *key = nullptr;
+    for (uint32_t i = 0; i < header_words(family); ++i)
+        if (!r.read_u32(&words[i], func))
+            return TEE_ERROR_GENERIC;
+    if (!r.read_bytes(words[0] / 8, &key, func))
+        return TEE_ERROR_GENERIC;
+    TEE_Result res = secret_key_object(words[1], words[0], key, object, func);
+    if (res != TEE_SUCCESS)
+        return res;
+    if (key_size)
+        *key_size = words[0];
+    if (key_type)
+        *key_type = words[1];
+    *error = KM_ERROR_OK;
+    return TEE_SUCCESS;
 }
 
 TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origin, int32_t *error, const char *func) {

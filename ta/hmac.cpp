@@ -77,7 +77,7 @@ TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, 
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kHmacKeys{.label = "hmac", .words = 2, .valid = valid_bit_length, .vet = vet_hmac};
+constexpr secret_key_family_t kHmacKeys{.label = "hmac", .tee_type = 0, .valid = valid_bit_length, .vet = vet_hmac};
 
 // Starts key data: allocates header + key_bytes and writes the two header words.
 } // namespace
@@ -101,23 +101,7 @@ TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *mat
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
                                  uint32_t *key_size, uint32_t *key_type, int32_t *error) {
-    *object = nullptr;
-    if (key_size)
-        *key_size = 0;
-    byte_reader r(key_data, key_data_len);
-    uint32_t bits = 0;
-    uint32_t type = 0;
-    const uint8_t *key = nullptr;
-    if (!r.read_u32(&bits) || !r.read_u32(&type) || !r.read_bytes(bits / 8, &key))
-        return TEE_ERROR_GENERIC;
-    TEE_Result res = secret_key_object(type, bits, key, object);
-    if (res != TEE_SUCCESS)
-        return res;
-    *key_type = type;
-    if (key_size)
-        *key_size = bits;
-    *error = KM_ERROR_OK;
-    return TEE_SUCCESS;
+    return provider_resolve_secret(kHmacKeys, key_data, key_data_len, object, key_size, key_type, error);
 }
 
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,

@@ -288,14 +288,6 @@ TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, cons
                                    uint32_t max_len, heap_buf *buf, int32_t *error, const char *func);
 
 /*
- * provider_secret_key - a new key_size-bit secret of TEE object type
- * `type`, written into dest (key_size / 8 bytes). The TEE's result, or
- * TEE_SUCCESS with *error -1000 when it hands back another length; each
- * failure logged in func's name.
- */
-TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, int32_t *error, const char *func);
-
-/*
  * provider_key_data - lays key data out in buf: count u32 words
  * (little-endian), then body_len bytes copied from body or, with body
  * null, left zero for the caller to fill at buf->get() + 4 * count. A
@@ -305,17 +297,6 @@ TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, 
  */
 TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t count, const uint8_t *body,
                              uint32_t body_len, int32_t oom_error, int32_t *error, const char *func);
-
-/*
- * provider_raw_key_size - the size in bits of raw key material of
- * material_len bytes, to be stored after `header` bytes: a length whose
- * bits overflow, or that valid() refuses, is "Invalid <label> key size %d"
- * with *error -6; a KM_TAG_KEY_SIZE that disagrees is refused as
- * provider_check_key_size says. True, with *bits, when usable.
- */
-bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
-                           bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
-                           const char *func);
 
 /*
  * provider_check_key_size - an import's key size: the caller's
@@ -328,16 +309,17 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
 
 /*
  * secret_key_family_t - what the key slots of a raw secret-key family
- * (AES, HMAC) differ in. Key data: `words` u32s (the key size, then the
- * TEE key type when words is 2), then the key bytes. label names the
- * family in "Invalid %s key size %d"; valid() takes its sizes; vet()
- * checks the other parameters for a key of bits (for generation or
- * import) and gives the TEE object type, setting *error or returning the
- * TEE's result when the parameters will not do.
+ * (AES, HMAC) differ in. Key data: the key size as a u32, then, for a
+ * family without one tee_type, each key's TEE type as a u32, then the key
+ * bytes. label names the family in "Invalid %s key size %d"; valid()
+ * takes its sizes; vet() checks the other parameters for a key of bits
+ * (for generation or import), sets the key's TEE type when the family
+ * has none, and sets *error or returns the TEE's result when they will
+ * not do.
  */
 struct secret_key_family_t {
     const char *label;
-    uint32_t words;
+    uint32_t tee_type; // 0: each key has its own
     bool (*valid)(uint32_t bits);
     TEE_Result (*vet)(keymaster_key_param_set_t *params, uint32_t bits, bool generating, uint32_t *tee_type,
                       int32_t *error, const char *func);
@@ -357,6 +339,17 @@ TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster
 TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
                                   const uint8_t *material, uint32_t material_len, uint8_t **key_data,
                                   uint32_t *key_data_len, int32_t *error, const char *func = __builtin_FUNCTION());
+
+/*
+ * provider_resolve_secret - the family's key data as a new TEE object the
+ * caller frees, with *key_size (if given) its bits and *key_type (if
+ * given) its TEE type. Key data cut short is "Too short input" and
+ * TEE_ERROR_GENERIC; TEE failures are returned; *object is null on any
+ * failure. The size is left to the TEE to judge.
+ */
+TEE_Result provider_resolve_secret(const secret_key_family_t &family, const uint8_t *key_data, uint32_t key_data_len,
+                                   TEE_ObjectHandle *object, uint32_t *key_size, uint32_t *key_type, int32_t *error,
+                                   const char *func = __builtin_FUNCTION());
 
 /*
  * key_output - the key data a provider's generate or import slot builds.
