@@ -99,96 +99,102 @@ TEE_Result make_key_data(keymaster_key_param_set_t *params, bool importing, cons
     return res;
 }
 
-} // namespace
-
-TEE_Result generate_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
-    key_request_t req;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-    // save_key rewrites *out_len: the wipe on failure must cover what the caller gave.
-    const uint32_t capacity = *out_len;
-    *error = KM_ERROR_OK;
-
-    do {
-        if (unmarshal(in, in_len, &req.params) != TEE_SUCCESS) {
-            KM_ERR("Unmarshal failed");
-            res = TEE_ERROR_BAD_PARAMETERS;
-            break;
-        }
-        KM_DUMP_PARAM_SET(&req.params);
-        res = make_key_data(&req.params, false, nullptr, 0, &req.key_data, error, __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-        res = save_key(req.key_data.get(), req.key_data.len(), &req.params, out, out_len);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("Can't save key to TEE storage");
-            break;
-        }
-        done = true;
-    } while (false);
-    if (!done) {
-        TEE_MemFill(out, 0, capacity);
-        *out_len = 0;
+// The request's parameters from their serialized bytes; "Unmarshal failed" and TEE_ERROR_BAD_PARAMETERS when they will
+// not parse.
+TEE_Result unmarshal_request(const uint8_t *ser, uint32_t ser_len, keymaster_key_param_set_t *params,
+                             const char *func) {
+    if (unmarshal(ser, ser_len, params) != TEE_SUCCESS) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unmarshal failed");
+        return TEE_ERROR_BAD_PARAMETERS;
     }
-    settle_error(res, done, error);
+    KM_DUMP_PARAM_SET(params);
+    return TEE_SUCCESS;
+}
+
+// save_key of the request's key data and parameters into blob (capacity *blob_len).
+TEE_Result save_key_logged(key_request_t *req, uint8_t *blob, uint32_t *blob_len, const char *func) {
+    TEE_Result res = save_key(req->key_data.get(), req->key_data.len(), &req->params, blob, blob_len);
+    if (res != TEE_SUCCESS)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Can't save key to TEE storage");
     return res;
 }
 
-TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+// The frame of generate_key and import_key: steps(request, capacity, &res)
+// runs once with *error cleared; on failure the caller's buffer is wiped
+// over the size it gave (save_key rewrites sizes on the way) and a failure
+// that set neither a result nor an error becomes -1000.
+template <typename Steps> TEE_Result key_command(uint8_t *out, uint32_t *out_len, int32_t *error, Steps steps) {
     key_request_t req;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
     const uint32_t capacity = *out_len;
+    TEE_Result res = TEE_SUCCESS;
     *error = KM_ERROR_OK;
-
-    do {
-        byte_reader r(in, in_len);
-        const uint8_t *ser = nullptr;
-        uint32_t ser_len = 0;
-        if (!r.read_lv(&ser, &ser_len)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        if (unmarshal(ser, ser_len, &req.params) != TEE_SUCCESS) {
-            KM_ERR("Unmarshal failed");
-            res = TEE_ERROR_BAD_PARAMETERS;
-            break;
-        }
-        KM_DUMP_PARAM_SET(&req.params);
-        // The material is every byte after the parameters.
-        res = make_key_data(&req.params, true, r.pos(), r.remaining(), &req.key_data, error, __func__);
-        if (res != TEE_SUCCESS || *error)
-            break;
-
-        byte_writer w(out, capacity);
-        uint8_t *blob_len_at = nullptr;
-        if (!w.reserve(4, &blob_len_at)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        uint32_t blob_len = w.remaining();
-        res = save_key(req.key_data.get(), req.key_data.len(), &req.params, w.pos(), &blob_len);
-        if (res != TEE_SUCCESS) {
-            KM_ERR("Can't save key to TEE storage");
-            break;
-        }
-        put_u32le(blob_len_at, blob_len);
-        uint8_t *blob_at = nullptr;
-        uint32_t chars_len = 0;
-        if (!w.reserve(blob_len, &blob_at)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        res = marshal_lv(&w, &req.params, &chars_len);
-        if (res != TEE_SUCCESS)
-            break;
-        *out_len = 8 + blob_len + chars_len;
-        done = true;
-    } while (false);
+    const bool done = steps(&req, capacity, &res);
     if (!done)
         TEE_MemFill(out, 0, capacity);
     settle_error(res, done, error);
     return res;
+}
+
+} // namespace
+
+TEE_Result generate_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    return key_command(out, out_len, error, [&](key_request_t *req, uint32_t capacity, TEE_Result *res) {
+        *out_len = 0; // until the blob is written
+        *res = unmarshal_request(in, in_len, &req->params, "generate_key");
+        if (*res != TEE_SUCCESS)
+            return false;
+        *res = make_key_data(&req->params, false, nullptr, 0, &req->key_data, error, "generate_key");
+        if (*res != TEE_SUCCESS || *error)
+            return false;
+        uint32_t blob_len = capacity;
+        *res = save_key_logged(req, out, &blob_len, "generate_key");
+        if (*res != TEE_SUCCESS)
+            return false;
+        *out_len = blob_len;
+        return true;
+    });
+}
+
+TEE_Result import_key(const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error) {
+    return key_command(out, out_len, error, [&](key_request_t *req, uint32_t capacity, TEE_Result *res) {
+        byte_reader r(in, in_len);
+        const uint8_t *ser = nullptr;
+        uint32_t ser_len = 0;
+        if (!r.read_lv(&ser, &ser_len, "import_key")) {
+            *res = TEE_ERROR_GENERIC;
+            return false;
+        }
+        *res = unmarshal_request(ser, ser_len, &req->params, "import_key");
+        if (*res != TEE_SUCCESS)
+            return false;
+        // The material is every byte after the parameters.
+        *res = make_key_data(&req->params, true, r.pos(), r.remaining(), &req->key_data, error, "import_key");
+        if (*res != TEE_SUCCESS || *error)
+            return false;
+        // The response: u32 blob length, the blob, u32 characteristics length, the characteristics.
+        byte_writer w(out, capacity);
+        uint8_t *blob_len_at = nullptr;
+        uint8_t *blob_at = nullptr;
+        uint32_t chars_len = 0;
+        if (!w.reserve(4, &blob_len_at, "import_key")) {
+            *res = TEE_ERROR_GENERIC;
+            return false;
+        }
+        uint32_t blob_len = w.remaining();
+        *res = save_key_logged(req, w.pos(), &blob_len, "import_key");
+        if (*res != TEE_SUCCESS)
+            return false;
+        put_u32le(blob_len_at, blob_len);
+        if (!w.reserve(blob_len, &blob_at, "import_key")) {
+            *res = TEE_ERROR_GENERIC;
+            return false;
+        }
+        *res = marshal_lv(&w, &req->params, &chars_len);
+        if (*res != TEE_SUCCESS)
+            return false;
+        *out_len = 8 + blob_len + chars_len;
+        return true;
+    });
 }
 
 TEE_Result get_key_character_size(const uint8_t *in, uint32_t in_len, int32_t *error, uint32_t *size) {
