@@ -20,8 +20,14 @@ bool valid_key_size(uint32_t bits) {
     return bits == 128 || bits == 192 || bits == 256;
 }
 
-// The family's vet: generation (not import) has the GCM rule: every GCM block mode (or no block mode at all) needs
-// one KM_TAG_MIN_MAC_LENGTH of 96 to 128 bits in whole bytes.
+// A GCM tag length the TEE takes: 96 to 128 bits in whole bytes.
+constexpr bool gcm_tag_bits(uint32_t bits) {
+    return bits >= 96 && bits <= 128 && bits % 8 == 0;
+}
+
+// The family's vet. Generation (not import) has the GCM rule: every GCM
+// block mode, or no block mode at all, needs one KM_TAG_MIN_MAC_LENGTH
+// that is a GCM tag length.
 TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating, uint32_t *, int32_t *error,
                    const char *func) {
     if (!generating)
@@ -39,7 +45,7 @@ TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating,
         return TEE_SUCCESS;
     }
     const uint32_t bits = min_mac->integer;
-    if (bits < 96 || bits > 128 || bits % 8 != 0) {
+    if (!gcm_tag_bits(bits)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d", static_cast<int>(bits));
         *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
     }
@@ -93,7 +99,7 @@ bool read_begin_params(aes_operation_t *op, keymaster_key_param_set_t *in_params
     // Below 96 bits the TEE refuses the tag length anyway; saying so here
     // gives the caller the precise error instead of an unknown one.
     const uint32_t bits = mac_length->integer;
-    if (bits < 96 || bits > 128 || bits % 8 != 0) {
+    if (!gcm_tag_bits(bits)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported mac length %d", static_cast<int>(bits));
         *error = KM_ERROR_UNSUPPORTED_MAC_LENGTH;
         return false;

@@ -7,11 +7,9 @@
 #include "ta_log.h"
 
 key_list *key_list_create(key_list_release_fn release) {
-    auto *list = static_cast<key_list *>(ta_malloc(sizeof(key_list)));
-    if (!list) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(sizeof(key_list)));
+    auto *list = ta_new<key_list>();
+    if (!list)
         return nullptr;
-    }
     list->count = 0;
     list->head = nullptr;
     list->release = release;
@@ -35,11 +33,9 @@ void key_list_destroy(key_list *list) {
 int key_list_add(key_list *list, int32_t key, void *value) {
     if (!list || key_list_find(list, key))
         return -1;
-    auto *node = static_cast<key_list_node_t *>(ta_malloc(sizeof(key_list_node_t)));
-    if (!node) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(sizeof(key_list_node_t)));
+    auto *node = ta_new<key_list_node_t>();
+    if (!node)
         return -1;
-    }
     node->key = key;
     node->value = value;
     node->prev = nullptr;

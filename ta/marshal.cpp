@@ -40,9 +40,8 @@ TEE_Result marshal(const keymaster_key_param_set_t *set, bool include_hidden, ui
     uint32_t count = 0;
 
     if (!*buf) {
-        *buf = static_cast<uint8_t *>(ta_malloc(size));
+        *buf = static_cast<uint8_t *>(ta_malloc_logged(size));
         if (!*buf) {
-            KM_ERR("Out of memory, need %dB", static_cast<int>(size));
             res = TEE_ERROR_OUT_OF_MEMORY;
             goto fail;
         }

@@ -28,11 +28,9 @@ const tlv_entry_t *find_entry(const tlv_box *box, uint16_t type) {
 } // namespace
 
 tlv_box *tlv_box_create() {
-    auto *box = static_cast<tlv_box *>(ta_malloc(sizeof(tlv_box)));
-    if (!box) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(sizeof(tlv_box)));
+    auto *box = ta_new<tlv_box>();
+    if (!box)
         return nullptr;
-    }
     box->entries = key_list_create(entry_release);
     if (!box->entries) {
         ta_free(box);
@@ -49,9 +47,8 @@ tlv_box *tlv_box_parse(const uint8_t *buffer, uint32_t length) {
     tlv_box *box = tlv_box_create();
     if (!box)
         return nullptr;
-    auto *copy = static_cast<uint8_t *>(ta_malloc(length));
+    auto *copy = static_cast<uint8_t *>(ta_malloc_logged(length));
     if (!copy) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(length));
         tlv_box_destroy(box);
         return nullptr;
     }
@@ -98,16 +95,13 @@ int tlv_box_putobject(tlv_box *box, uint16_t type, const void *value, uint32_t l
         return -1;
     if (box->serialized_size > UINT32_MAX - 4 - length)
         return -1;
-    auto *entry = static_cast<tlv_entry_t *>(ta_malloc(sizeof(tlv_entry_t)));
-    if (!entry) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(sizeof(tlv_entry_t)));
+    auto *entry = ta_new<tlv_entry_t>();
+    if (!entry)
         return -1;
-    }
     entry->type = type;
     entry->length = static_cast<uint16_t>(length);
-    entry->value = static_cast<uint8_t *>(ta_malloc(length));
+    entry->value = static_cast<uint8_t *>(ta_malloc_logged(length));
     if (!entry->value) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(length));
         ta_free(entry);
         return -1;
     }
@@ -124,11 +118,9 @@ int tlv_box_putobject(tlv_box *box, uint16_t type, const void *value, uint32_t l
 int tlv_box_serialize(tlv_box *box) {
     if (!box || box->serialized)
         return -1;
-    auto *out = static_cast<uint8_t *>(ta_malloc(box->serialized_size));
-    if (!out) {
-        KM_ERR("Out of memory, need %dB", static_cast<int>(box->serialized_size));
+    auto *out = static_cast<uint8_t *>(ta_malloc_logged(box->serialized_size));
+    if (!out)
         return -1;
-    }
     byte_writer w(out, box->serialized_size);
     for (key_list_node_t *node = box->entries->head; node; node = node->next) {
         const auto *entry = static_cast<const tlv_entry_t *>(node->value);

@@ -15,14 +15,17 @@ enum key_protection_t : uint8_t {
     KEY_PROTECTION_RPMB = 1,
 };
 
-constexpr uint32_t kBlobHeaderSize = 93; // kind, derivation input, nonce, tag
-constexpr uint32_t kBlobOverhead = 101;  // header plus the two length words
-constexpr uint32_t kBlobDeriveOffset = 1;
+// A blob's header: the protection byte, the derivation input, the nonce
+// and the tag, each placed right after the one before.
 constexpr uint32_t kBlobDeriveSize = 64;
-constexpr uint32_t kBlobNonceOffset = 65;
 constexpr uint32_t kBlobNonceSize = 12;
-constexpr uint32_t kBlobTagOffset = 77;
 constexpr uint32_t kBlobTagSize = 16;
+constexpr uint32_t kBlobDeriveOffset = 1;
+constexpr uint32_t kBlobNonceOffset = kBlobDeriveOffset + kBlobDeriveSize;
+constexpr uint32_t kBlobTagOffset = kBlobNonceOffset + kBlobNonceSize;
+constexpr uint32_t kBlobHeaderSize = kBlobTagOffset + kBlobTagSize;
+constexpr uint32_t kBlobOverhead = kBlobHeaderSize + 8; // and the two length words
+static_assert(kBlobHeaderSize == 93 && kBlobOverhead == 101, "the blob layout is fixed by the interface");
 
 /* The KSKs: null when absent. Read by the blob code. */
 extern TEE_ObjectHandle derived_ksk;

@@ -12,6 +12,8 @@
 
 #include <tee_internal_api.h>
 
+#include "ta_log.h"
+
 /*
  * ta_malloc - allocates size zero-filled bytes; a non-null pointer even for
  * 0 bytes. Returns null when the heap is exhausted. The caller owns the
@@ -19,6 +21,24 @@
  */
 inline void *ta_malloc(uint32_t size, const char *file = __builtin_FILE(), int line = __builtin_LINE()) {
     return TEE_MallocAt(size, TEE_MALLOC_FILL_ZERO, file, line);
+}
+
+/*
+ * ta_malloc_logged - ta_malloc that, when the heap is exhausted, logs "Out
+ * of memory, need %dB" in the caller's name before returning null.
+ */
+inline void *ta_malloc_logged(uint32_t size, const char *func = __builtin_FUNCTION(),
+                              const char *file = __builtin_FILE(), int line = __builtin_LINE()) {
+    void *p = ta_malloc(size, file, line);
+    if (!p)
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "Out of memory, need %dB", static_cast<int>(size));
+    return p;
+}
+
+/* ta_new - a zero-filled T from ta_malloc_logged; null (logged) when the heap is exhausted. */
+template <typename T>
+T *ta_new(const char *func = __builtin_FUNCTION(), const char *file = __builtin_FILE(), int line = __builtin_LINE()) {
+    return static_cast<T *>(ta_malloc_logged(sizeof(T), func, file, line));
 }
 
 /*
