@@ -338,15 +338,13 @@ void record_release::missing(bool required) const {
 void record_release::object(TEE_ObjectHandle *h, bool required) {
     if (!*h)
         return missing(required);
-    TEE_FreeTransientObject(*h);
-    *h = nullptr;
+    free_object(h);
 }
 
 void record_release::operation(TEE_OperationHandle *h, bool required) {
     if (!*h)
         return missing(required);
-    TEE_FreeOperation(*h);
-    *h = nullptr;
+    free_operation(h);
 }
 
 void record_release::buffer(uint8_t **p, uint32_t len, bool required) {

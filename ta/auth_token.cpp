@@ -44,10 +44,8 @@ void release_all() {
     if (auth_token_cache)
         TEE_MemFill(auth_token_cache, 0, kAuthTokenCacheSlots * sizeof(auth_token_slot_t));
     ta_free(auth_token_cache);
-    if (auth_token_key)
-        TEE_FreeTransientObject(auth_token_key);
     auth_token_cache = nullptr;
-    auth_token_key = nullptr;
+    free_object(&auth_token_key);
 }
 
 } // namespace

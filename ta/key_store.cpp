@@ -184,18 +184,10 @@ TEE_Result key_store_init() {
 }
 
 void key_store_deinit() {
-    if (derived_ksk)
-        TEE_FreeTransientObject(derived_ksk);
-    if (rpmb_ksk)
-        TEE_FreeTransientObject(rpmb_ksk);
-    derived_ksk = nullptr;
-    rpmb_ksk = nullptr;
-    if (derived_ksk_mac)
-        TEE_FreeOperation(derived_ksk_mac);
-    if (rpmb_ksk_mac)
-        TEE_FreeOperation(rpmb_ksk_mac);
-    derived_ksk_mac = nullptr;
-    rpmb_ksk_mac = nullptr;
+    free_object(&derived_ksk);
+    free_object(&rpmb_ksk);
+    free_operation(&derived_ksk_mac);
+    free_operation(&rpmb_ksk_mac);
     key_cache_deinit();
 }
 

@@ -263,30 +263,26 @@ TEE_Result parse_buf_fill_key(soter_key_pair *key, const uint8_t *buf, uint32_t 
         vlb *field;
         uint16_t tag;
     };
-    const field_tag public_part[] = {{&key->modulus, SOTER_TAG_MODULUS},
-                                     {&key->public_exponent, SOTER_TAG_PUBLIC_EXPONENT},
-                                     {&key->private_exponent, SOTER_TAG_PRIVATE_EXPONENT}};
-    for (const field_tag &f : public_part) {
-        TEE_Result res = init_vlb_with_tag(f.field, box, f.tag);
-        if (res != TEE_SUCCESS) {
-            free_soter_key(key);
-            return res;
+    // n, e and d are required; a key without p has no CRT values at all.
+    const field_tag fields[] = {{&key->modulus, SOTER_TAG_MODULUS},
+                                {&key->public_exponent, SOTER_TAG_PUBLIC_EXPONENT},
+                                {&key->private_exponent, SOTER_TAG_PRIVATE_EXPONENT},
+                                {&key->prime1, SOTER_TAG_PRIME1},
+                                {&key->prime2, SOTER_TAG_PRIME2},
+                                {&key->exponent1, SOTER_TAG_EXPONENT1},
+                                {&key->exponent2, SOTER_TAG_EXPONENT2},
+                                {&key->coefficient, SOTER_TAG_COEFFICIENT}};
+    constexpr uint32_t kFirstCrtField = 3;
+    for (uint32_t i = 0; i < sizeof fields / sizeof fields[0]; ++i) {
+        TEE_Result res = init_vlb_with_tag(fields[i].field, box, fields[i].tag);
+        if (res == TEE_SUCCESS)
+            continue;
+        if (i == kFirstCrtField) {
+            KM_DEBUG("This rsa key pair only have n, e, d\n");
+            return TEE_SUCCESS;
         }
-    }
-    if (init_vlb_with_tag(&key->prime1, box, SOTER_TAG_PRIME1) != TEE_SUCCESS) {
-        KM_DEBUG("This rsa key pair only have n, e, d\n");
-        return TEE_SUCCESS;
-    }
-    const field_tag crt_part[] = {{&key->prime2, SOTER_TAG_PRIME2},
-                                  {&key->exponent1, SOTER_TAG_EXPONENT1},
-                                  {&key->exponent2, SOTER_TAG_EXPONENT2},
-                                  {&key->coefficient, SOTER_TAG_COEFFICIENT}};
-    for (const field_tag &f : crt_part) {
-        TEE_Result res = init_vlb_with_tag(f.field, box, f.tag);
-        if (res != TEE_SUCCESS) {
-            free_soter_key(key);
-            return res;
-        }
+        free_soter_key(key);
+        return res;
     }
     return TEE_SUCCESS;
 }
@@ -409,8 +405,7 @@ TEE_ObjectHandle resolve_key_from_data(const uint8_t *key_data, uint32_t key_dat
     int32_t error = 0;
     TEE_Result res = rsa_resolve_key_data(key_data, key_data_len, &obj, key_size, &error);
     if (res != TEE_SUCCESS || error != 0 || !obj) {
-        if (obj)
-            TEE_FreeTransientObject(obj);
+        free_object(&obj);
         KM_ERR("Resolve key data failed");
         return nullptr;
     }

@@ -10,6 +10,23 @@
 #include "ta_log.h"
 
 /*
+ * free_handle - releases *h with Release when it is set and clears it:
+ * for handles kept outside a guard. free_object and free_operation are
+ * the two kinds.
+ */
+template <typename Handle, void (*Release)(Handle)> void free_handle(Handle *h) {
+    if (*h)
+        Release(*h);
+    *h = nullptr;
+}
+inline void free_object(TEE_ObjectHandle *h) {
+    free_handle<TEE_ObjectHandle, TEE_FreeTransientObject>(h);
+}
+inline void free_operation(TEE_OperationHandle *h) {
+    free_handle<TEE_OperationHandle, TEE_FreeOperation>(h);
+}
+
+/*
  * tee_handle_guard - owns one TEE handle and releases it with Release on
  * scope exit. out() hands the slot to an allocating call; release() gives
  * the handle up to the caller.
@@ -31,11 +48,7 @@ template <typename Handle, void (*Release)(Handle)> class tee_handle_guard {
         h_ = nullptr;
         return h;
     }
-    void reset() {
-        if (h_)
-            Release(h_);
-        h_ = nullptr;
-    }
+    void reset() { free_handle<Handle, Release>(&h_); }
 
   private:
     Handle h_ = nullptr;
