@@ -199,6 +199,28 @@ operation_t *begin_create(uint32_t purpose, begin_request_t *r, keymaster_key_pa
     return op;
 }
 
+// The frame of update and finish: the record of handle (none: -28), then
+// steps(op, in_params, &res, &ended), which returns true when done. A
+// failure after the record was found ends the operation unless the steps
+// ended it already; a failure that set nothing becomes -1000.
+template <typename Steps> TEE_Result continue_operation(uint32_t handle, int32_t *error, Steps steps) {
+    keymaster_key_param_set_t in_params{};
+    param_set_guard in_guard(&in_params);
+    TEE_Result res = TEE_SUCCESS;
+    bool ended = false;
+    *error = KM_ERROR_OK;
+    operation_t *op = operation_pool_get(handle);
+    if (!op) {
+        *error = KM_ERROR_INVALID_OPERATION_HANDLE;
+        return TEE_SUCCESS;
+    }
+    const bool done = steps(op, &in_params, &res, &ended);
+    if (!done && !ended)
+        end_operation(op, handle);
+    settle_error(res, done, error);
+    return res;
+}
+
 } // namespace
 
 TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
@@ -251,103 +273,77 @@ TEE_Result begin(uint32_t purpose, const uint8_t *in, uint32_t in_len, uint8_t *
 
 TEE_Result update(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len, int32_t *error,
                   uint32_t *consumed) {
-    keymaster_key_param_set_t in_params{};
-    param_set_guard in_guard(&in_params);
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
-    *error = KM_ERROR_OK;
-    operation_t *op = operation_pool_get(handle);
-    if (!op) {
-        *error = KM_ERROR_INVALID_OPERATION_HANDLE;
-        return TEE_SUCCESS;
-    }
-    do {
-        byte_reader r(in, in_len);
-        const uint8_t *data = nullptr;
-        const uint8_t *ser = nullptr;
-        uint32_t data_len = 0;
-        uint32_t ser_len = 0;
-        if (!r.read_lv(&data, &data_len)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        *consumed = data_len;
-        if (!r.read_lv(&ser, &ser_len)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        if (!step_ready(ser, ser_len, &in_params, op, handle, op->fns->update, "Update not implemented", &res, error,
-                        __func__))
-            break;
-        res = op->fns->update(op, &in_params, data, consumed, out, out_len, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_ERR("Update failed");
-            break;
-        }
-        done = true;
-    } while (false);
-    if (!done)
-        end_operation(op, handle);
-    settle_error(res, done, error);
-    return res;
+    return continue_operation(handle, error,
+                              [&](operation_t *op, keymaster_key_param_set_t *in_params, TEE_Result *res, bool *) {
+                                  byte_reader r(in, in_len);
+                                  const uint8_t *data = nullptr;
+                                  const uint8_t *ser = nullptr;
+                                  uint32_t data_len = 0;
+                                  uint32_t ser_len = 0;
+                                  if (!r.read_lv(&data, &data_len, "update")) {
+                                      *res = TEE_ERROR_GENERIC;
+                                      return false;
+                                  }
+                                  *consumed = data_len;
+                                  if (!r.read_lv(&ser, &ser_len, "update")) {
+                                      *res = TEE_ERROR_GENERIC;
+                                      return false;
+                                  }
+                                  if (!step_ready(ser, ser_len, in_params, op, handle, op->fns->update,
+                                                  "Update not implemented", res, error, "update"))
+                                      return false;
+                                  *res = op->fns->update(op, in_params, data, consumed, out, out_len, error);
+                                  if (*res != TEE_SUCCESS || *error) {
+                                      KM_TRACE_AT(TEE_TRACE_ERROR, "update", __LINE__, "Update failed");
+                                      return false;
+                                  }
+                                  return true;
+                              });
 }
 
 TEE_Result finish(uint32_t handle, const uint8_t *in, uint32_t in_len, uint8_t *out, uint32_t *out_len,
                   int32_t *error) {
-    keymaster_key_param_set_t in_params{};
-    keymaster_key_param_set_t out_params{};
-    param_set_guard in_guard(&in_params);
-    param_set_guard out_guard(&out_params);
-    heap_buf output(true);
-    bool ended = false;
-    bool done = false;
-    TEE_Result res = TEE_SUCCESS;
     const uint32_t capacity = *out_len;
-    *error = KM_ERROR_OK;
-    operation_t *op = operation_pool_get(handle);
-    if (!op) {
-        *error = KM_ERROR_INVALID_OPERATION_HANDLE;
-        return TEE_SUCCESS;
-    }
-    do {
-        const uint8_t *signature = nullptr;
-        const uint8_t *ser = nullptr;
-        uint32_t signature_len = 0;
-        uint32_t ser_len = 0;
-        if (!read_request(in, in_len, &signature, &signature_len, &ser, &ser_len, __func__)) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        if (!step_ready(ser, ser_len, &in_params, op, handle, op->fns->finish, "Finish not implemented", &res, error,
-                        __func__))
-            break;
-        uint8_t *result = nullptr;
-        uint32_t result_len = 0;
-        res = op->fns->finish(op, &in_params, signature, signature_len, &result, &result_len, &out_params, error);
-        output.adopt(result, result_len);
-        if (res != TEE_SUCCESS || *error) {
-            KM_ERR("Finish failed");
-            break;
-        }
-        end_operation(op, handle);
-        ended = true;
+    return continue_operation(
+        handle, error, [&](operation_t *op, keymaster_key_param_set_t *in_params, TEE_Result *res, bool *ended) {
+            keymaster_key_param_set_t out_params{};
+            param_set_guard out_guard(&out_params);
+            heap_buf output(true);
+            const uint8_t *signature = nullptr;
+            const uint8_t *ser = nullptr;
+            uint32_t signature_len = 0;
+            uint32_t ser_len = 0;
+            if (!read_request(in, in_len, &signature, &signature_len, &ser, &ser_len, "finish")) {
+                *res = TEE_ERROR_GENERIC;
+                return false;
+            }
+            if (!step_ready(ser, ser_len, in_params, op, handle, op->fns->finish, "Finish not implemented", res, error,
+                            "finish"))
+                return false;
+            uint8_t *result = nullptr;
+            uint32_t result_len = 0;
+            *res = op->fns->finish(op, in_params, signature, signature_len, &result, &result_len, &out_params, error);
+            output.adopt(result, result_len);
+            if (*res != TEE_SUCCESS || *error) {
+                KM_TRACE_AT(TEE_TRACE_ERROR, "finish", __LINE__, "Finish failed");
+                return false;
+            }
+            end_operation(op, handle);
+            *ended = true;
 
-        byte_writer w(out, capacity);
-        uint32_t params_len = 0;
-        if (!w.write_u32(output.len()) || !w.write_bytes(output.get(), output.len())) {
-            res = TEE_ERROR_GENERIC;
-            break;
-        }
-        res = marshal_lv(&w, &out_params, &params_len);
-        if (res != TEE_SUCCESS)
-            break;
-        *out_len = 8 + output.len() + params_len;
-        done = true;
-    } while (false);
-    if (!ended)
-        end_operation(op, handle);
-    settle_error(res, done, error);
-    return res;
+            // The response: u32 output length, the output, u32 parameters length, the parameters.
+            byte_writer w(out, capacity);
+            uint32_t params_len = 0;
+            if (!w.write_u32(output.len(), "finish") || !w.write_bytes(output.get(), output.len(), "finish")) {
+                *res = TEE_ERROR_GENERIC;
+                return false;
+            }
+            *res = marshal_lv(&w, &out_params, &params_len);
+            if (*res != TEE_SUCCESS)
+                return false;
+            *out_len = 8 + output.len() + params_len;
+            return true;
+        });
 }
 
 TEE_Result abort_operation(uint32_t handle, int32_t *error) {
