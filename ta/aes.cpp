@@ -283,8 +283,7 @@ TEE_Result aes_cipher_final(aes_operation_t *op, int32_t *error, const char *fun
 void aes_operation_release(operation_t *header, bool audit) {
     auto *op = operation_record<aes_operation_t>(header);
     record_release r(header, audit);
-    r.object(&op->key);
-    r.operation(&op->operation);
+    r.keyed(op);
     r.buffer(&op->tag_buffer, op->mac_length / 8, false);
     r.buffer(&op->last_block, kAesBlock, false);
 }

@@ -298,8 +298,7 @@ TEE_Result ec_operation_message(ec_operation_t *op, uint32_t *len, const char *f
 void ec_operation_release(operation_t *header, bool audit) {
     auto *op = operation_record<ec_operation_t>(header);
     record_release r(header, audit);
-    r.object(&op->key);
-    r.operation(&op->operation);
+    r.keyed(op);
     r.operation(&op->digest_operation, false);
     r.buffer(&op->message, message_room(op));
 }

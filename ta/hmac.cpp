@@ -79,7 +79,6 @@ TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, 
 
 constexpr secret_key_family_t kHmacKeys{.label = "hmac", .tee_type = 0, .valid = valid_bit_length, .vet = vet_hmac};
 
-// Starts key data: allocates header + key_bytes and writes the two header words.
 } // namespace
 
 uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
@@ -170,10 +169,7 @@ TEE_Result hmac_operation_mac(hmac_operation_t *op, uint8_t *mac, uint32_t *mac_
 }
 
 void hmac_operation_release(operation_t *header, bool audit) {
-    auto *op = operation_record<hmac_operation_t>(header);
-    record_release r(header, audit);
-    r.object(&op->key);
-    r.operation(&op->operation);
+    record_release(header, audit).keyed(operation_record<hmac_operation_t>(header));
 }
 
 namespace {

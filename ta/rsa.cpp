@@ -487,8 +487,7 @@ TEE_Result rsa_cipher_update(operation_t *header, const uint8_t *input, uint32_t
 void rsa_operation_release(operation_t *header, bool audit) {
     auto *op = operation_record<rsa_operation_t>(header);
     record_release r(header, audit);
-    r.object(&op->key);
-    r.operation(&op->operation);
+    r.keyed(op);
     r.buffer(&op->block, op->key_size / 8);
 }
 

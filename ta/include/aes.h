@@ -35,10 +35,7 @@ resolve_key_data_fn aes_resolve_key_data;
  * candidate tag (mac_length / 8 bytes, tag_fill of them used) and, with
  * PKCS#7, the last decrypted block.
  */
-struct aes_operation_t {
-    operation_t header;
-    TEE_OperationHandle operation;
-    TEE_ObjectHandle key;
+struct aes_operation_t : keyed_record_t {
     uint32_t padding;
     uint32_t block_mode;
     uint32_t key_size;

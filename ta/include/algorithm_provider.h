@@ -93,9 +93,20 @@ constexpr operation_fns_t operation_fns(const char *record_name, update_fn *upda
     };
 }
 
+/*
+ * keyed_record_t - the leading part of every provider's record: the
+ * header, then the TEE operation and the key object it runs with.
+ */
+struct keyed_record_t {
+    operation_t header;
+    TEE_OperationHandle operation;
+    TEE_ObjectHandle key;
+};
+
 /* operation_record - the provider's view of a record built from its table. */
 template <typename Record> Record *operation_record(operation_t *op) {
-    return reinterpret_cast<Record *>(op);
+    // header leads keyed_record_t, so the two addresses are one.
+    return static_cast<Record *>(reinterpret_cast<keyed_record_t *>(op));
 }
 
 /* How complete a record is when it is destroyed. */
@@ -124,6 +135,11 @@ class record_release {
     void operation(TEE_OperationHandle *h, bool required = true);
     /* buffer - frees *p after wiping len bytes of it. */
     void buffer(uint8_t **p, uint32_t len, bool required = true);
+    /* keyed - the key object and the TEE operation of keyed_record_t, both required. */
+    void keyed(keyed_record_t *rec) {
+        object(&rec->key);
+        operation(&rec->operation);
+    }
 
   private:
     void missing(bool required) const;

@@ -43,11 +43,8 @@ resolve_key_data_fn ec_resolve_key_data;
  * (message_len is its room) or, unhashed, up to one field of input
  * (message_len is what is buffered).
  */
-struct ec_operation_t {
-    operation_t header;
-    TEE_OperationHandle operation;
+struct ec_operation_t : keyed_record_t {
     TEE_OperationHandle digest_operation;
-    TEE_ObjectHandle key;
     uint8_t *message;
     uint32_t message_len;
     uint32_t digest;

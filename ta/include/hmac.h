@@ -31,10 +31,7 @@ uint32_t hmac_algorithm_for_key_type(uint32_t key_type);
  * the keyed, initialised MAC operation and its key, the key size and the
  * requested MAC length (bits).
  */
-struct hmac_operation_t {
-    operation_t header;
-    TEE_OperationHandle operation;
-    TEE_ObjectHandle key;
+struct hmac_operation_t : keyed_record_t {
     uint32_t key_size;
     uint32_t mac_length;
 };

@@ -33,10 +33,7 @@ resolve_key_data_fn rsa_resolve_key_data;
  * message, the final digest or the input to encrypt or decrypt) and how
  * much of it is used, and the begin parameters.
  */
-struct rsa_operation_t {
-    operation_t header;
-    TEE_OperationHandle operation;
-    TEE_ObjectHandle key;
+struct rsa_operation_t : keyed_record_t {
     uint8_t *block;
     uint32_t block_len;
     uint32_t digest;
