@@ -67,11 +67,12 @@ TEE_Result export_key_unsupported(const uint8_t *, uint32_t, uint8_t *, uint32_t
 }
 
 namespace {
-constexpr uint32_t kMaxKeyAttributes = 8;
-} // namespace
 
-TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t *ids, uint32_t count,
-                                   uint32_t max_len, heap_buf *buf, int32_t *error, const char *func) {
+constexpr uint32_t kMaxKeyAttributes = 8;
+
+// provider_generated_pair's second half: the attributes of obj written out.
+TEE_Result key_attributes(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t *ids, uint32_t count,
+                          uint32_t max_len, heap_buf *buf, int32_t *error, const char *func) {
     uint32_t lengths[kMaxKeyAttributes] = {};
     if (count > kMaxKeyAttributes)
         return TEE_ERROR_GENERIC;
@@ -118,6 +119,18 @@ TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, cons
         }
     }
     return TEE_SUCCESS;
+}
+
+} // namespace
+
+TEE_Result provider_generated_pair(uint32_t type, uint32_t key_size, const TEE_Attribute &param, const uint32_t *ids,
+                                   uint32_t count, uint32_t max_len, heap_buf *buf, int32_t *error, const char *func) {
+    object_guard obj;
+    TEE_Result res =
+        key_object(type, key_size, &param, 1, obj.out(), key_fill::generate, tee_call_texts::standard, func, __LINE__);
+    if (res != TEE_SUCCESS)
+        return res;
+    return key_attributes(obj.get(), key_size, ids, count, max_len, buf, error, func);
 }
 
 const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {

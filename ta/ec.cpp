@@ -59,14 +59,6 @@ bool supported_size(uint32_t key_size, const char *func) {
     return false;
 }
 
-// A fresh key pair on the curve of key_size.
-TEE_Result generate_pair(const ec_curve_t &c, object_guard *obj) {
-    TEE_Attribute curve{};
-    TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, c.curve, 0);
-    return key_object(TEE_TYPE_ECDSA_KEYPAIR, c.key_size, &curve, 1, obj->out(), key_fill::generate,
-                      tee_call_texts::standard, "ec_generate_key", __LINE__);
-}
-
 } // namespace
 
 TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
@@ -81,12 +73,10 @@ TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data
                 return false;
             }
             const uint32_t key_size = size->integer;
-            object_guard obj;
-            *res = generate_pair(*curve_of(key_size), &obj);
-            if (*res != TEE_SUCCESS)
-                return false;
-            *res = provider_key_attributes(obj.get(), key_size, kAttributeIds, kValues, ec_field_bytes(key_size), buf,
-                                           error, "ec_generate_key");
+            TEE_Attribute curve{};
+            TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, curve_of(key_size)->curve, 0);
+            *res = provider_generated_pair(TEE_TYPE_ECDSA_KEYPAIR, key_size, curve, kAttributeIds, kValues,
+                                           ec_field_bytes(key_size), buf, error, "ec_generate_key");
             return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
         });
 }

@@ -93,16 +93,6 @@ bool generation_params(const keymaster_key_param_set_t *params, uint64_t *expone
     return true;
 }
 
-// A fresh key pair of key_size bits with that public exponent.
-TEE_Result generate_pair(uint32_t key_size, uint64_t exponent, object_guard *obj) {
-    uint8_t e[8] = {};
-    put_u64be(e, exponent);
-    TEE_Attribute attr{};
-    TEE_InitRefAttribute(&attr, TEE_ATTR_RSA_PUBLIC_EXPONENT, e, sizeof e);
-    return key_object(TEE_TYPE_RSA_KEYPAIR, key_size, &attr, 1, obj->out(), key_fill::generate,
-                      tee_call_texts::standard, "rsa_generate_key", __LINE__);
-}
-
 // Import's exponent rule: e must fit the tag's 64 bits, whether the tag is
 // given (and then agrees with e's bytes) or derived from e.
 TEE_Result import_exponent(keymaster_key_param_set_t *params, const components_t &c, int32_t *error) {
@@ -135,20 +125,20 @@ TEE_Result import_exponent(keymaster_key_param_set_t *params, const components_t
 
 TEE_Result rsa_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
                             int32_t *error) {
-    return provider_key_slot(params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
-                             [&](heap_buf *buf, TEE_Result *res) {
-                                 uint64_t exponent = 0;
-                                 uint32_t key_size = 0;
-                                 if (!generation_params(params, &exponent, &key_size, error))
-                                     return false;
-                                 object_guard obj;
-                                 *res = generate_pair(key_size, exponent, &obj);
-                                 if (*res != TEE_SUCCESS)
-                                     return false;
-                                 *res = provider_key_attributes(obj.get(), key_size, kAttributeIds, kRsaComponents,
-                                                                key_size / 8, buf, error, "rsa_generate_key");
-                                 return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
-                             });
+    return provider_key_slot(
+        params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
+            uint64_t exponent = 0;
+            uint32_t key_size = 0;
+            if (!generation_params(params, &exponent, &key_size, error))
+                return false;
+            uint8_t e[8] = {};
+            put_u64be(e, exponent);
+            TEE_Attribute attr{};
+            TEE_InitRefAttribute(&attr, TEE_ATTR_RSA_PUBLIC_EXPONENT, e, sizeof e);
+            *res = provider_generated_pair(TEE_TYPE_RSA_KEYPAIR, key_size, attr, kAttributeIds, kRsaComponents,
+                                           key_size / 8, buf, error, "rsa_generate_key");
+            return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
+        });
 }
 
 TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,

@@ -292,7 +292,8 @@ TEE_Result provider_import_slot(keymaster_key_param_set_t *params, const uint8_t
 const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func);
 
 /*
- * provider_key_attributes - the key data of a generated key pair: u32
+ * provider_generated_pair - the key data of a fresh key pair of TEE type
+ * `type` and key_size bits, generated with the one parameter `param`: u32
  * key_size, then each attribute of ids, in order, as u32 length + its
  * big-endian bytes, each at most max_len bytes, written into buf. A first
  * pass learns the lengths through a wiped scratch buffer, so that buf is
@@ -300,8 +301,8 @@ const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, in
  * result, TEE_ERROR_OUT_OF_MEMORY for buf, or *error -41 (scratch) and
  * -1000 (a length that changed) otherwise, logged in func's name.
  */
-TEE_Result provider_key_attributes(TEE_ObjectHandle obj, uint32_t key_size, const uint32_t *ids, uint32_t count,
-                                   uint32_t max_len, heap_buf *buf, int32_t *error, const char *func);
+TEE_Result provider_generated_pair(uint32_t type, uint32_t key_size, const TEE_Attribute &param, const uint32_t *ids,
+                                   uint32_t count, uint32_t max_len, heap_buf *buf, int32_t *error, const char *func);
 
 /*
  * provider_key_data - lays key data out in buf: count u32 words
