@@ -359,19 +359,18 @@ TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *in
     return TEE_SUCCESS;
 }
 
-TEE_Result rsa_signature_digest(rsa_signature_operation_t *op, const char *func) {
-    uint32_t len = op->key_size / 8;
-    TEE_Result res = TEE_DigestDoFinal(op->digest_operation, nullptr, 0, op->block, &len);
-    if (res != TEE_SUCCESS) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "DigestDoFinal failed with 0x%08x\n", res);
-        return res;
-    }
-    op->block_len = len;
-    return TEE_SUCCESS;
-}
-
-void rsa_signature_block(rsa_signature_operation_t *op) {
+TEE_Result rsa_signature_message(rsa_signature_operation_t *op, const char *func) {
     const uint32_t key_bytes = op->key_size / 8;
+    if (op->digest_operation) {
+        uint32_t len = key_bytes;
+        TEE_Result res = TEE_DigestDoFinal(op->digest_operation, nullptr, 0, op->block, &len);
+        if (res != TEE_SUCCESS) {
+            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "DigestDoFinal failed with 0x%08x\n", res);
+            return res;
+        }
+        op->block_len = len;
+        return TEE_SUCCESS;
+    }
     const uint32_t m = op->block_len;
     uint8_t *b = op->block;
     TEE_MemMove(b + key_bytes - m, b, m);
@@ -385,6 +384,7 @@ void rsa_signature_block(rsa_signature_operation_t *op) {
         TEE_MemFill(b, 0x00, key_bytes - m);
     }
     op->block_len = key_bytes;
+    return TEE_SUCCESS;
 }
 
 void rsa_signature_release(operation_t *header, bool audit) {

@@ -21,14 +21,13 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
     heap_buf out;
     *output = nullptr;
     *output_len = 0;
-    TEE_Result res = TEE_SUCCESS;
+    TEE_Result res = rsa_signature_message(op, __func__);
+    if (res != TEE_SUCCESS)
+        return res;
+    if (!rsa_output_alloc(&out, op->key_size, error))
+        return TEE_SUCCESS;
+    uint32_t len = key_bytes;
     if (op->digest_operation) {
-        res = rsa_signature_digest(op, __func__);
-        if (res != TEE_SUCCESS)
-            return res;
-        if (!rsa_output_alloc(&out, op->key_size, error))
-            return TEE_SUCCESS;
-        uint32_t len = key_bytes;
         // A digest-length salt whenever it fits, else the longest that does.
         const uint32_t h = rsa_digest_length(op->digest);
         TEE_Attribute salt{};
@@ -41,19 +40,14 @@ TEE_Result rsa_sign_finish(operation_t *header, keymaster_key_param_set_t *, con
             KM_ERR("AsymmetricSignDigest failed with 0x%08x\n", res);
             return res;
         }
-        out.set_len(len);
     } else {
-        if (!rsa_output_alloc(&out, op->key_size, error))
-            return TEE_SUCCESS;
-        rsa_signature_block(op);
-        uint32_t len = 0;
         res = rsa_raw(op, rsa_raw_call::sign, op->block, key_bytes, out.get(), &len, error);
         if (res != TEE_SUCCESS || *error)
             return res;
         // Verifiers expect k bytes; raw results come without leading zeros.
         rsa_left_pad(out.get(), &len, op->key_size);
-        out.set_len(len);
     }
+    out.set_len(len);
     *output_len = out.len();
     *output = out.release();
     *error = KM_ERROR_OK;

@@ -29,11 +29,10 @@ TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, c
     heap_buf work(true);
     if (!rsa_output_alloc(&work, op->key_size, error))
         return TEE_SUCCESS;
-    TEE_Result res = TEE_SUCCESS;
+    TEE_Result res = rsa_signature_message(op, __func__);
+    if (res != TEE_SUCCESS)
+        return res;
     if (op->digest_operation) {
-        res = rsa_signature_digest(op, __func__);
-        if (res != TEE_SUCCESS)
-            return res;
         TEE_Attribute salt{};
         const uint32_t attr_count = rsa_salt_attribute(op->padding, TEE_RSA_PSS_SALT_MAX_OR_AUTO, &salt);
         res = TEE_AsymmetricVerifyDigest(op->operation, attr_count ? &salt : nullptr, attr_count, op->block,
@@ -46,7 +45,6 @@ TEE_Result rsa_verify_finish(operation_t *header, keymaster_key_param_set_t *, c
             *error = KM_ERROR_OK;
         return res;
     }
-    rsa_signature_block(op);
     uint32_t len = key_bytes;
     res = TEE_AsymmetricEncrypt(op->operation, nullptr, 0, signature, signature_len, work.get(), &len);
     if (res != TEE_SUCCESS) {

@@ -75,10 +75,13 @@ operation_t *rsa_cipher_create(const uint8_t *key_data, uint32_t key_data_len, k
 /* rsa_signature_buffer - feeds the digest, or buffers unhashed input up to its limit (-21 past it). */
 TEE_Result rsa_signature_buffer(rsa_signature_operation_t *op, const uint8_t *input, uint32_t *input_len,
                                 int32_t *error, const char *verb, const char *func);
-/* rsa_signature_digest - finishes the digest into the message buffer. */
-TEE_Result rsa_signature_digest(rsa_signature_operation_t *op, const char *func);
-/* rsa_signature_block - turns the buffered message into the k-byte block signed without a digest. */
-void rsa_signature_block(rsa_signature_operation_t *op);
+/*
+ * rsa_signature_message - the value both finishes work on, in the message
+ * buffer: the digest finished there (its failure logged in func's name
+ * and returned), or without a digest the buffered message made into the
+ * k-byte block (zero-padded for raw RSA, 00 01 FF..FF 00 M for PKCS#1).
+ */
+TEE_Result rsa_signature_message(rsa_signature_operation_t *op, const char *func);
 /*
  * rsa_operation_release - the release slot of the encrypt and decrypt
  * tables: key object, RSA operation and block buffer, each required of a
