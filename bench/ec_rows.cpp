@@ -12,7 +12,6 @@
 #include <openssl/x509.h>
 
 #include "keymaster_defs.h"
-#include "km/key_material.h"
 #include "rows.h"
 
 namespace bench {
@@ -120,17 +119,13 @@ Row ec_row(TaSession &ta, const Hsm &hsm, EVP_PKEY *key, const Bytes &blob, cons
 }
 
 Bytes import_ec(TaSession &ta, const Bytes &pkcs8, uint32_t digest) {
-    std::string why;
-    auto material = km::ec_import_material(pkcs8, &why);
-    if (!material)
-        throw std::runtime_error("EC import material: " + why);
     km::ParamSet params;
     params.add(KM_TAG_ALGORITHM, KM_ALGORITHM_EC)
         .add(KM_TAG_PURPOSE, KM_PURPOSE_SIGN)
         .add(KM_TAG_PURPOSE, KM_PURPOSE_VERIFY)
         .add(KM_TAG_DIGEST, digest)
         .add_bool(KM_TAG_NO_AUTH_REQUIRED);
-    return ta.import_key(params, *material);
+    return ta.import_private_key(params, KM_ALGORITHM_EC, pkcs8);
 }
 
 } // namespace

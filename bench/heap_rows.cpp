@@ -8,7 +8,6 @@
 #include <string>
 
 #include "keymaster_defs.h"
-#include "km/key_material.h"
 #include "rows.h"
 #include "rsa_keys.h"
 
@@ -19,17 +18,13 @@ std::vector<Row> heap_rows(TaSession &ta, const Hsm &) {
     constexpr size_t kLimit = 512 * 1024;
     // A fixed key: generating 4096-bit keys takes seconds.
     const Bytes pem(kRsa4096Pem, kRsa4096Pem + sizeof kRsa4096Pem - 1);
-    std::string why;
-    auto material = km::rsa_import_material(pem, &why);
-    if (!material)
-        throw std::runtime_error("RSA-4096 import material: " + why);
     km::ParamSet params;
     params.add(KM_TAG_ALGORITHM, KM_ALGORITHM_RSA)
         .add(KM_TAG_PURPOSE, KM_PURPOSE_SIGN)
         .add(KM_TAG_PADDING, KM_PAD_RSA_PKCS1_1_5_SIGN)
         .add(KM_TAG_DIGEST, KM_DIGEST_NONE)
         .add_bool(KM_TAG_NO_AUTH_REQUIRED);
-    const Bytes blob = ta.import_key(params, *material);
+    const Bytes blob = ta.import_private_key(params, KM_ALGORITHM_RSA, pem);
     km::ParamSet begin;
     begin.add(KM_TAG_PADDING, KM_PAD_RSA_PKCS1_1_5_SIGN).add(KM_TAG_DIGEST, KM_DIGEST_NONE);
     TaOperation op(ta, KM_PURPOSE_SIGN, blob, begin, {});

@@ -11,7 +11,6 @@
 #include <openssl/rsa.h>
 
 #include "keymaster_defs.h"
-#include "km/key_material.h"
 #include "rows.h"
 
 namespace bench {
@@ -126,10 +125,6 @@ std::vector<Row> rsa_rows(TaSession &ta, const Hsm &hsm) {
     EVP_PKEY *raw_key = nullptr;
     const Bytes pem = fresh_pkcs8(&raw_key);
     std::shared_ptr<EVP_PKEY> key(raw_key, EVP_PKEY_free);
-    std::string why;
-    auto material = km::rsa_import_material(pem, &why);
-    if (!material)
-        throw std::runtime_error("RSA import material: " + why);
     km::ParamSet params;
     params.add(KM_TAG_ALGORITHM, KM_ALGORITHM_RSA)
         .add(KM_TAG_PURPOSE, KM_PURPOSE_SIGN)
@@ -138,7 +133,7 @@ std::vector<Row> rsa_rows(TaSession &ta, const Hsm &hsm) {
         .add(KM_TAG_PADDING, KM_PAD_RSA_PSS)
         .add(KM_TAG_DIGEST, KM_DIGEST_SHA_2_256)
         .add_bool(KM_TAG_NO_AUTH_REQUIRED);
-    const Bytes blob = ta.import_key(params, *material);
+    const Bytes blob = ta.import_private_key(params, KM_ALGORITHM_RSA, pem);
     // The rows keep the key alive through their raw contexts' own references.
     // Only PKCS#1 v1.5 is compared with SoftHSM2; PSS verification is informational.
     std::vector<Row> rows = {

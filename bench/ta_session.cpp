@@ -8,6 +8,7 @@
 #include <system_error>
 
 #include "keymaster_defs.h"
+#include "km/key_material.h"
 #include "ta_entry.h"
 
 namespace bench {
@@ -69,6 +70,15 @@ TaSession::~TaSession() {
 Reply TaSession::invoke(uint32_t command, uint32_t a, const Bytes &in, Bytes &out) {
     return call_with([&](uint32_t types, TEE_Param *p) { return tee_->invoke(session_, command, types, p); }, a, in,
                      out);
+}
+
+Bytes TaSession::import_private_key(const km::ParamSet &params, uint32_t algorithm, const Bytes &key_file) {
+    std::string why;
+    const bool rsa = algorithm == KM_ALGORITHM_RSA;
+    auto material = rsa ? km::rsa_import_material(key_file, &why) : km::ec_import_material(key_file, &why);
+    if (!material)
+        throw std::runtime_error(std::string(rsa ? "RSA" : "EC") + " import material: " + why);
+    return import_key(params, *material);
 }
 
 Bytes TaSession::import_key(const km::ParamSet &params, const Bytes &material) {

@@ -86,6 +86,11 @@ class TaSession {
     // import_key - the key blob for this material; throws when refused.
     Bytes import_key(const km::ParamSet &params, const Bytes &material);
 
+    // import_private_key - import_key of an RSA or EC private key file (PEM
+    // or DER, by algorithm) converted by the client library; throws when it
+    // will not convert or the TA refuses it.
+    Bytes import_private_key(const km::ParamSet &params, uint32_t algorithm, const Bytes &key_file);
+
     // abort - ends the operation `handle`; throws when refused.
     void abort(uint32_t handle);
 
