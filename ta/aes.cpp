@@ -20,9 +20,40 @@ bool valid_key_size(uint32_t bits) {
     return bits == 128 || bits == 192 || bits == 256;
 }
 
-// A GCM tag length the TEE takes: 96 to 128 bits in whole bytes.
-constexpr bool gcm_tag_bits(uint32_t bits) {
-    return bits >= 96 && bits <= 128 && bits % 8 == 0;
+// A tag whose value must be a GCM tag length the TEE takes (96 to 128 bits
+// in whole bytes), with what to log and answer when it is missing or not one.
+struct gcm_bits_rule_t {
+    uint32_t tag;
+    const char *missing; // logged when the tag is absent or repeated
+    int32_t missing_error;
+    const char *unsupported; // logged with the value
+    int32_t unsupported_error;
+};
+
+constexpr gcm_bits_rule_t kMinMacRule{KM_TAG_MIN_MAC_LENGTH, "No or too many KM_TAG_MIN_MAC_LENGTH",
+                                      KM_ERROR_MISSING_MIN_MAC_LENGTH, "Invalid KM_TAG_MIN_MAC_LENGTH",
+                                      KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH};
+// Below 96 bits the TEE refuses the tag length anyway; saying so at begin
+// gives the caller the precise error instead of an unknown one.
+constexpr gcm_bits_rule_t kMacRule{KM_TAG_MAC_LENGTH, "No or too many KM_TAG_MAC_LENGTH", KM_ERROR_INVALID_ARGUMENT,
+                                   "Unsupported mac length", KM_ERROR_UNSUPPORTED_MAC_LENGTH};
+
+// The rule's tag from params into *bits; false (logged, *error set) when it breaks the rule.
+bool read_gcm_tag_bits(const keymaster_key_param_set_t *params, const gcm_bits_rule_t &rule, uint32_t *bits,
+                       int32_t *error, const char *func) {
+    const key_param_t *p = key_param_set_find_unique(params, rule.tag);
+    if (!p) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "%s", rule.missing);
+        *error = rule.missing_error;
+        return false;
+    }
+    if (p->integer < 96 || p->integer > 128 || p->integer % 8 != 0) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "%s %d", rule.unsupported, static_cast<int>(p->integer));
+        *error = rule.unsupported_error;
+        return false;
+    }
+    *bits = p->integer;
+    return true;
 }
 
 // The family's vet. Generation (not import) has the GCM rule: every GCM
@@ -38,17 +69,8 @@ TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating,
             wanted = true;
     if (!wanted)
         return TEE_SUCCESS;
-    const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
-    if (!min_mac) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH");
-        *error = KM_ERROR_MISSING_MIN_MAC_LENGTH;
-        return TEE_SUCCESS;
-    }
-    const uint32_t bits = min_mac->integer;
-    if (!gcm_tag_bits(bits)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d", static_cast<int>(bits));
-        *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
-    }
+    uint32_t bits = 0;
+    read_gcm_tag_bits(params, kMinMacRule, &bits, error, func);
     return TEE_SUCCESS;
 }
 
@@ -90,22 +112,7 @@ bool read_begin_params(aes_operation_t *op, keymaster_key_param_set_t *in_params
     op->padding = padding ? padding->enumerated : static_cast<uint32_t>(KM_PAD_NONE);
     if (op->block_mode != KM_MODE_GCM)
         return true;
-    const key_param_t *mac_length = key_param_set_find_unique(in_params, KM_TAG_MAC_LENGTH);
-    if (!mac_length) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MAC_LENGTH");
-        *error = KM_ERROR_INVALID_ARGUMENT;
-        return false;
-    }
-    // Below 96 bits the TEE refuses the tag length anyway; saying so here
-    // gives the caller the precise error instead of an unknown one.
-    const uint32_t bits = mac_length->integer;
-    if (!gcm_tag_bits(bits)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Unsupported mac length %d", static_cast<int>(bits));
-        *error = KM_ERROR_UNSUPPORTED_MAC_LENGTH;
-        return false;
-    }
-    op->mac_length = bits;
-    return true;
+    return read_gcm_tag_bits(in_params, kMacRule, &op->mac_length, error, func);
 }
 
 // Step 6 of create: the nonce given or drawn initialises the operation
