@@ -26,6 +26,9 @@ soter_prop_set props = {};
 uint32_t fid_value = 0;
 uint64_t fid_timestamp = 0;
 bool fid_reported = false;
+// The notification's size, and how long a reported fid stays fresh.
+constexpr uint32_t kFidNotificationBytes = 16;
+constexpr uint64_t kFidFreshMs = 3000;
 
 constexpr int32_t kVerifyNoKey = -1;
 constexpr int32_t kVerifyFailed = -2;
@@ -280,10 +283,8 @@ TEE_Result do_digest_with_sha(uint32_t algorithm, const uint8_t *message, uint32
     if (res != TEE_SUCCESS)
         return res;
     TEE_DigestUpdate(op.get(), message, message_len);
-    res = TEE_DigestDoFinal(op.get(), nullptr, 0, digest, digest_len);
-    if (res != TEE_SUCCESS)
-        KM_ERR("TEE_DigestDoFinal failed: %08x\n", res);
-    return res;
+    return tee_logged(TEE_DigestDoFinal(op.get(), nullptr, 0, digest, digest_len), "DigestDoFinal",
+                      tee_call_texts::prefixed);
 }
 
 TEE_Result do_sign_with_rsa(TEE_ObjectHandle key, uint32_t key_size, const uint8_t *digest, uint32_t digest_len,
@@ -293,14 +294,13 @@ TEE_Result do_sign_with_rsa(TEE_ObjectHandle key, uint32_t key_size, const uint8
                                      tee_call_texts::prefixed);
     if (res != TEE_SUCCESS)
         return res;
-    res = TEE_AsymmetricSignDigest(op.get(), nullptr, 0, digest, digest_len, signature, signature_len);
-    if (res != TEE_SUCCESS)
-        KM_ERR("TEE_AsymmetricSignDigest failed: %08x\n", res);
-    return res;
+    return tee_logged(TEE_AsymmetricSignDigest(op.get(), nullptr, 0, digest, digest_len, signature, signature_len),
+                      "AsymmetricSignDigest", tee_call_texts::prefixed);
 }
 
 TEE_Result digest_and_sign(TEE_ObjectHandle key, uint32_t key_size, const uint8_t *message, uint32_t message_len,
                            uint8_t *signature, uint32_t *signature_len) {
+    constexpr uint32_t kSoterDigestRoom = 256; // any TEE digest fits
     heap_buf digest;
     if (!digest.alloc(kSoterDigestRoom))
         return TEE_ERROR_OUT_OF_MEMORY;
@@ -409,6 +409,7 @@ TEE_Result soter_enhance_export_key(const keymaster_key_param_set_t *key_params,
             return TEE_ERROR_BAD_STATE;
         }
     }
+    constexpr uint32_t kSoterPemRoom = 1024; // an RSA-2048 public key in PEM
     heap_buf pem;
     if (!pem.alloc(kSoterPemRoom))
         return TEE_ERROR_OUT_OF_MEMORY;
@@ -446,7 +447,7 @@ TEE_Result soter_enhance_export_key(const keymaster_key_param_set_t *key_params,
         KM_ERR("Sign key is null\n");
         return TEE_ERROR_BAD_STATE;
     }
-    uint8_t signature[kSoterExportSignatureRoom] = {};
+    uint8_t signature[256] = {}; // RSA-2048, the largest signer
     uint32_t signature_len = sizeof signature;
     res = digest_and_sign(signer.get(), signer_size, reinterpret_cast<const uint8_t *>(text.text), json_len, signature,
                           &signature_len);

@@ -23,6 +23,11 @@ constexpr uint32_t kPropTextSize = 64;
 constexpr uint32_t kAttkBits = 2048;
 constexpr uint32_t kFpUuidSize = 16;
 
+// The provisioning TA's commands.
+constexpr uint32_t kOrvelCmdGetKey = 2;
+constexpr uint32_t kOrvelCmdGetData = 5;
+constexpr uint32_t kOrvelCmdGetProperty = 12;
+
 void vlb_free(vlb *field, bool secret) {
     if (secret)
         ta_free_wiped(field->buf, field->len);
@@ -127,7 +132,9 @@ TEE_Result init_soter_cpuid(vlb *cpu_id) {
         return TEE_ERROR_OUT_OF_MEMORY;
     }
     uint32_t len = kPropTextSize;
-    TEE_Result res = retrieve_orvel_property(kOrvelPropCpuIdFirst, kOrvelPropCpuIdSecond, cpu_id->buf, &len);
+    constexpr uint16_t kCpuIdFirst = 0x1734; // the request (first, second) that answers the CPU id
+    constexpr uint16_t kCpuIdSecond = 0x173A;
+    TEE_Result res = retrieve_orvel_property(kCpuIdFirst, kCpuIdSecond, cpu_id->buf, &len);
     if (res == TEE_SUCCESS && len > kPropTextSize)
         res = TEE_ERROR_BAD_FORMAT;
     if (res != TEE_SUCCESS) {
@@ -263,15 +270,11 @@ TEE_Result parse_buf_fill_key(soter_key_pair *key, const uint8_t *buf, uint32_t 
         vlb *field;
         uint16_t tag;
     };
-    // n, e and d are required; a key without p has no CRT values at all.
-    const field_tag fields[] = {{&key->modulus, SOTER_TAG_MODULUS},
-                                {&key->public_exponent, SOTER_TAG_PUBLIC_EXPONENT},
-                                {&key->private_exponent, SOTER_TAG_PRIVATE_EXPONENT},
-                                {&key->prime1, SOTER_TAG_PRIME1},
-                                {&key->prime2, SOTER_TAG_PRIME2},
-                                {&key->exponent1, SOTER_TAG_EXPONENT1},
-                                {&key->exponent2, SOTER_TAG_EXPONENT2},
-                                {&key->coefficient, SOTER_TAG_COEFFICIENT}};
+    // The key answer's TLV tags, field by field. n, e and d are required; a
+    // key without p has no CRT values at all.
+    const field_tag fields[] = {{&key->modulus, 17},   {&key->public_exponent, 18}, {&key->private_exponent, 19},
+                                {&key->prime1, 20},    {&key->prime2, 21},          {&key->exponent1, 22},
+                                {&key->exponent2, 23}, {&key->coefficient, 24}};
     constexpr uint32_t kFirstCrtField = 3;
     for (uint32_t i = 0; i < sizeof fields / sizeof fields[0]; ++i) {
         TEE_Result res = init_vlb_with_tag(fields[i].field, box, fields[i].tag);
@@ -307,19 +310,24 @@ TEE_Result init_soter_key(soter_key_pair *key) {
 }
 
 TEE_Result init_soter_prop_set(soter_prop_set *props) {
+    // The property answer's TLV tags, and the request that gets it.
+    constexpr uint16_t kSensorNameTag = 0x1835;
+    constexpr uint16_t kSensorVersionTag = 0x1836;
+    constexpr uint16_t kFpTaUuidTag = 0x1837;
+    constexpr uint16_t kOrvelPropSoter = 0x1834;
     tlv_box *box = nullptr;
     const uint8_t *uuid = nullptr;
     uint32_t uuid_len = 0;
     TEE_Result res = retrieve_soter_property(kOrvelPropSoter, &box);
     if (res != TEE_SUCCESS)
         goto fail;
-    res = init_prop_with_tag(&props->fp_sensor_name, box, SOTER_TAG_FP_SENSOR_NAME);
+    res = init_prop_with_tag(&props->fp_sensor_name, box, kSensorNameTag);
     if (res != TEE_SUCCESS)
         goto fail;
-    res = init_prop_with_tag(&props->fp_sensor_version, box, SOTER_TAG_FP_SENSOR_VERSION);
+    res = init_prop_with_tag(&props->fp_sensor_version, box, kSensorVersionTag);
     if (res != TEE_SUCCESS)
         goto fail;
-    if (tlv_box_get_bytes_ptr(box, SOTER_TAG_FP_TA_UUID, &uuid, &uuid_len) != 0) {
+    if (tlv_box_get_bytes_ptr(box, kFpTaUuidTag, &uuid, &uuid_len) != 0) {
         KM_ERR("get fp uuid bytes ptr error");
         res = TEE_ERROR_GENERIC;
         goto fail;

@@ -48,15 +48,8 @@ TEE_Result soter_handle_verify_attk_key_pair(int32_t *result);
 TEE_Result soter_handle_export_attk_public_key(uint8_t *buf, uint32_t *size, int32_t *result);
 TEE_Result soter_handle_get_device_id(uint8_t *buf, uint32_t *size, int32_t *result);
 
-/* The fingerprint notification: its size, and how long a reported fid stays fresh. */
-constexpr uint32_t kFidNotificationBytes = 16;
-constexpr uint64_t kFidFreshMs = 3000;
 /* get_fresh_fid's answer for a stale or never reported fid. */
 constexpr TEE_Result kSoterErrorStaleFid = 0xFFFF3001;
-/* Room for the export's PEM text, its signature (RSA-2048 at most) and a digest. */
-constexpr uint32_t kSoterPemRoom = 1024;
-constexpr uint32_t kSoterExportSignatureRoom = 256;
-constexpr uint32_t kSoterDigestRoom = 256;
 
 /*
  * increase_and_get_counter - advances the persistent SOTER counter (created
@@ -87,7 +80,7 @@ TEE_Result is_from_fp_ta();
 TEE_Result get_client_property(TEE_Identity *identity);
 
 /*
- * get_fresh_fid - the reported fid when it is at most kFidFreshMs old by
+ * get_fresh_fid - the reported fid when it is at most 3 seconds old by
  * the TEE system time; else (also when none was ever reported)
  * kSoterErrorStaleFid with *fid 0xFFFFFFFF. Reading does not consume it.
  */

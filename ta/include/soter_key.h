@@ -47,30 +47,9 @@ struct soter_prop_set {
 /* soter_provisioning_ta_uuid - the provisioning TA this build talks to. */
 extern const TEE_UUID soter_provisioning_ta_uuid;
 
-/* Provisioning-TA commands and the identifiers of its property requests. */
-constexpr uint32_t kOrvelCmdGetKey = 2;
-constexpr uint32_t kOrvelCmdGetData = 5;
-constexpr uint32_t kOrvelCmdGetProperty = 12;
-constexpr uint16_t kOrvelPropSoter = 0x1834;
-constexpr uint16_t kOrvelPropCpuIdFirst = 0x1734;
-constexpr uint16_t kOrvelPropCpuIdSecond = 0x173A;
+/* The property request (first, second) that answers the device identifier. */
 constexpr uint16_t kOrvelPropDeviceIdFirst = 0x1934;
 constexpr uint16_t kOrvelPropDeviceIdSecond = 0x1936;
-
-/* TLV tags of the key answer and the SOTER property answer. */
-enum soter_tlv_tag_t : uint16_t {
-    SOTER_TAG_MODULUS = 17,
-    SOTER_TAG_PUBLIC_EXPONENT = 18,
-    SOTER_TAG_PRIVATE_EXPONENT = 19,
-    SOTER_TAG_PRIME1 = 20,
-    SOTER_TAG_PRIME2 = 21,
-    SOTER_TAG_EXPONENT1 = 22,
-    SOTER_TAG_EXPONENT2 = 23,
-    SOTER_TAG_COEFFICIENT = 24,
-    SOTER_TAG_FP_SENSOR_NAME = 0x1835,
-    SOTER_TAG_FP_SENSOR_VERSION = 0x1836,
-    SOTER_TAG_FP_TA_UUID = 0x1837,
-};
 
 /*
  * retrieve_key_from_orvel / retrieve_data_from_orvel - commands 2 and 5 into

@@ -75,6 +75,17 @@ inline void tee_call_failed(tee_call_texts texts, const char *call, TEE_Result r
         KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "%s failed with 0x%08x\n", call, res);
 }
 
+/*
+ * tee_logged - res as it is, logged by tee_call_failed when it is a
+ * failure: for a TEE call whose result is the caller's answer.
+ */
+inline TEE_Result tee_logged(TEE_Result res, const char *call, tee_call_texts texts,
+                             const char *func = __builtin_FUNCTION(), int line = __builtin_LINE()) {
+    if (res != TEE_SUCCESS)
+        tee_call_failed(texts, call, res, func, line);
+    return res;
+}
+
 /* How key_object fills its new object. */
 enum class key_fill : uint8_t {
     populate, // with the given attributes (TEE_PopulateTransientObject)
