@@ -24,29 +24,25 @@ bool valid_key_size(uint32_t bits) {
 // in whole bytes), with what to log and answer when it is missing or not one.
 struct gcm_bits_rule_t {
     uint32_t tag;
-    const char *missing; // logged when the tag is absent or repeated
+    const char *name; // the tag's name in the log line when it is absent or repeated
     int32_t missing_error;
     const char *unsupported; // logged with the value
     int32_t unsupported_error;
 };
 
-constexpr gcm_bits_rule_t kMinMacRule{KM_TAG_MIN_MAC_LENGTH, "No or too many KM_TAG_MIN_MAC_LENGTH",
-                                      KM_ERROR_MISSING_MIN_MAC_LENGTH, "Invalid KM_TAG_MIN_MAC_LENGTH",
-                                      KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH};
+constexpr gcm_bits_rule_t kMinMacRule{KM_TAG_MIN_MAC_LENGTH, "KM_TAG_MIN_MAC_LENGTH", KM_ERROR_MISSING_MIN_MAC_LENGTH,
+                                      "Invalid KM_TAG_MIN_MAC_LENGTH", KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH};
 // Below 96 bits the TEE refuses the tag length anyway; saying so at begin
 // gives the caller the precise error instead of an unknown one.
-constexpr gcm_bits_rule_t kMacRule{KM_TAG_MAC_LENGTH, "No or too many KM_TAG_MAC_LENGTH", KM_ERROR_INVALID_ARGUMENT,
+constexpr gcm_bits_rule_t kMacRule{KM_TAG_MAC_LENGTH, "KM_TAG_MAC_LENGTH", KM_ERROR_INVALID_ARGUMENT,
                                    "Unsupported mac length", KM_ERROR_UNSUPPORTED_MAC_LENGTH};
 
 // The rule's tag from params into *bits; false (logged, *error set) when it breaks the rule.
 bool read_gcm_tag_bits(const keymaster_key_param_set_t *params, const gcm_bits_rule_t &rule, uint32_t *bits,
                        int32_t *error, const char *func) {
-    const key_param_t *p = key_param_set_find_unique(params, rule.tag);
-    if (!p) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "%s", rule.missing);
-        *error = rule.missing_error;
+    const key_param_t *p = provider_param(params, rule.tag, rule.name, error, func, rule.missing_error);
+    if (!p)
         return false;
-    }
     if (p->integer < 96 || p->integer > 128 || p->integer % 8 != 0) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "%s %d", rule.unsupported, static_cast<int>(p->integer));
         *error = rule.unsupported_error;
@@ -101,12 +97,9 @@ const aes_mode_t *find_mode(uint32_t block_mode) {
 
 // Steps 3 and 4 of create: block mode, padding and (GCM) the MAC length.
 bool read_begin_params(aes_operation_t *op, keymaster_key_param_set_t *in_params, int32_t *error, const char *func) {
-    const key_param_t *mode = key_param_set_find_unique(in_params, KM_TAG_BLOCK_MODE);
-    if (!mode) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_BLOCK_MODE");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+    const key_param_t *mode = provider_param(in_params, KM_TAG_BLOCK_MODE, "KM_TAG_BLOCK_MODE", error, func);
+    if (!mode)
         return false;
-    }
     op->block_mode = mode->enumerated;
     const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
     op->padding = padding ? padding->enumerated : static_cast<uint32_t>(KM_PAD_NONE);
@@ -199,14 +192,8 @@ TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, 
 operation_t *aes_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                   keymaster_key_param_set_t *out_params, uint32_t mode, int32_t *error,
                                   const operation_fns_t *fns, const char *func) {
-    operation_t *header = operation_record_alloc(fns, func);
-    if (!header) {
-        key_param_set_release(out_params);
-        return nullptr;
-    }
-    auto *op = operation_record<aes_operation_t>(header);
     const bool decrypting = mode == TEE_MODE_DECRYPT;
-    bool ok = [&] {
+    operation_t *header = operation_record_create<aes_operation_t>(fns, func, [&](aes_operation_t *op) {
         TEE_Result res = aes_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error);
         if (res != TEE_SUCCESS || *error) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
@@ -237,12 +224,10 @@ operation_t *aes_operation_create(const uint8_t *key_data, uint32_t key_data_len
         if (decrypting && op->padding == KM_PAD_PKCS7 && !hold_back_buffer(&op->last_block, kAesBlock, error, func))
             return false;
         return true;
-    }();
-    if (ok)
-        return header;
-    key_param_set_release(out_params);
-    operation_destroy(header, record_state::partial);
-    return nullptr;
+    });
+    if (!header)
+        key_param_set_release(out_params);
+    return header;
 }
 
 bool aes_operation_aad(aes_operation_t *op, keymaster_key_param_set_t *in_params, int32_t *error, const char *func) {

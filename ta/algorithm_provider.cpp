@@ -133,13 +133,18 @@ TEE_Result provider_generated_pair(uint32_t type, uint32_t key_size, const TEE_A
     return key_attributes(obj.get(), key_size, ids, count, max_len, buf, error, func);
 }
 
-const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
-    const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
-    if (!size) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_KEY_SIZE or specified");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+const key_param_t *provider_param(const keymaster_key_param_set_t *params, uint32_t tag, const char *what,
+                                  int32_t *error, const char *func, int32_t missing_error, int line) {
+    const key_param_t *p = key_param_set_find_unique(params, tag);
+    if (!p) {
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "No or too many %s", what);
+        *error = missing_error;
     }
-    return size;
+    return p;
+}
+
+const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
+    return provider_param(params, KM_TAG_KEY_SIZE, "KM_TAG_KEY_SIZE or specified", error, func);
 }
 
 TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,

@@ -208,21 +208,14 @@ uint32_t message_room(const ec_operation_t *op) {
 
 operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                  uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func) {
-    operation_t *header = operation_record_alloc(fns, func);
-    if (!header)
-        return nullptr;
-    auto *op = operation_record<ec_operation_t>(header);
-    bool ok = [&] {
+    return operation_record_create<ec_operation_t>(fns, func, [&](ec_operation_t *op) {
         if (ec_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS || !op->key) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
             return false;
         }
-        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
-        if (!digest) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
-            *error = KM_ERROR_INVALID_ARGUMENT;
+        const key_param_t *digest = provider_param(in_params, KM_TAG_DIGEST, "KM_TAG_DIGEST", error, func);
+        if (!digest)
             return false;
-        }
         op->digest = digest->enumerated;
         const ec_curve_t *c = curve_of(op->key_size);
         if (!c) {
@@ -233,11 +226,7 @@ operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len,
         return start_message(op, error, func) &&
                keyed_operation(&op->operation, c->algorithm, mode, op->key_size, op->key, tee_call_texts::standard,
                                func) == TEE_SUCCESS;
-    }();
-    if (ok)
-        return header;
-    operation_destroy(header, record_state::partial);
-    return nullptr;
+    });
 }
 
 TEE_Result ec_operation_update(operation_t *header, keymaster_key_param_set_t *, const uint8_t *input,

@@ -36,24 +36,20 @@ bool valid_bit_length(uint32_t bits) {
 // length and digest rules; the digest's row gives the TEE key type.
 TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, uint32_t *tee_type, int32_t *error,
                     const char *func) {
-    const key_param_t *min_mac = key_param_set_find_unique(params, KM_TAG_MIN_MAC_LENGTH);
-    if (!min_mac) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MIN_MAC_LENGTH or specified");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+    const key_param_t *min_mac =
+        provider_param(params, KM_TAG_MIN_MAC_LENGTH, "KM_TAG_MIN_MAC_LENGTH or specified", error, func);
+    if (!min_mac)
         return TEE_SUCCESS;
-    }
     if (!valid_bit_length(min_mac->integer)) {
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid KM_TAG_MIN_MAC_LENGTH %d",
                     static_cast<int>(min_mac->integer));
         *error = KM_ERROR_UNSUPPORTED_MIN_MAC_LENGTH;
         return TEE_SUCCESS;
     }
-    const key_param_t *digest = key_param_set_find_unique(params, KM_TAG_DIGEST);
-    if (!digest) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
-        *error = KM_ERROR_UNSUPPORTED_DIGEST;
+    const key_param_t *digest =
+        provider_param(params, KM_TAG_DIGEST, "KM_TAG_DIGEST", error, func, KM_ERROR_UNSUPPORTED_DIGEST);
+    if (!digest)
         return TEE_SUCCESS;
-    }
     const hmac_digest_t *row = nullptr;
     for (const hmac_digest_t &r : kDigestTable)
         if (r.digest == digest->enumerated)
@@ -106,25 +102,16 @@ TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len,
 operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                    keymaster_key_param_set_t *out_params, int32_t *error, const operation_fns_t *fns,
                                    const char *func) {
-    operation_t *header = operation_record_alloc(fns, func);
-    if (!header) {
-        key_param_set_release(out_params);
-        return nullptr;
-    }
-    auto *op = operation_record<hmac_operation_t>(header);
-    bool ok = [&] {
+    operation_t *header = operation_record_create<hmac_operation_t>(fns, func, [&](hmac_operation_t *op) {
         uint32_t key_type = 0;
         TEE_Result res = hmac_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, &key_type, error);
         if (res != TEE_SUCCESS || *error) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
             return false;
         }
-        const key_param_t *mac_length = key_param_set_find_unique(in_params, KM_TAG_MAC_LENGTH);
-        if (!mac_length) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_MAC_LENGTH");
-            *error = KM_ERROR_INVALID_ARGUMENT;
+        const key_param_t *mac_length = provider_param(in_params, KM_TAG_MAC_LENGTH, "KM_TAG_MAC_LENGTH", error, func);
+        if (!mac_length)
             return false;
-        }
         op->mac_length = mac_length->integer;
         const uint32_t algorithm = hmac_algorithm_for_key_type(key_type);
         if (!algorithm) {
@@ -137,12 +124,10 @@ operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_le
             return false;
         TEE_MACInit(op->operation, nullptr, 0);
         return true;
-    }();
-    if (ok)
-        return header;
-    key_param_set_release(out_params);
-    operation_destroy(header, record_state::partial);
-    return nullptr;
+    });
+    if (!header)
+        key_param_set_release(out_params);
+    return header;
 }
 
 TEE_Result hmac_operation_update(operation_t *op, keymaster_key_param_set_t *, const uint8_t *input,

@@ -72,13 +72,10 @@ namespace {
 // The generation parameters: a single public exponent and a supported key size.
 bool generation_params(const keymaster_key_param_set_t *params, uint64_t *exponent, uint32_t *key_size,
                        int32_t *error) {
-    const key_param_t *e = key_param_set_find_unique(params, KM_TAG_RSA_PUBLIC_EXPONENT);
-    if (!e) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__,
-                    "No or too many KM_TAG_RSA_PUBLIC_EXPONENT specified");
-        *error = KM_ERROR_INVALID_ARGUMENT;
+    const key_param_t *e = provider_param(params, KM_TAG_RSA_PUBLIC_EXPONENT, "KM_TAG_RSA_PUBLIC_EXPONENT specified",
+                                          error, "rsa_generate_key");
+    if (!e)
         return false;
-    }
     const key_param_t *size = provider_key_size(params, error, "rsa_generate_key");
     if (!size)
         return false;
@@ -231,44 +228,36 @@ namespace {
 rsa_operation_t *rsa_record_start(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                   bool digest_required, int32_t oom_error, int32_t *error, const operation_fns_t *fns,
                                   const char *func) {
-    operation_t *header = operation_record_alloc(fns, func);
-    if (!header) {
-        if (oom_error)
-            *error = oom_error;
-        return nullptr;
-    }
-    auto *op = operation_record<rsa_operation_t>(header);
-    bool ok = false;
-    do {
+    bool allocated = false;
+    operation_t *header = operation_record_create<rsa_operation_t>(fns, func, [&](rsa_operation_t *op) {
+        allocated = true;
         if (rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
-            break;
+            return false;
         }
         op->block = static_cast<uint8_t *>(ta_malloc(op->key_size / 8));
         if (!op->block) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
             *error = KM_ERROR_MEMORY_ALLOCATION_FAILED;
-            break;
+            return false;
         }
-        const key_param_t *padding = key_param_set_find_unique(in_params, KM_TAG_PADDING);
-        if (!padding) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_PADDING");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
-        const key_param_t *digest = key_param_set_find_unique(in_params, KM_TAG_DIGEST);
-        if (!digest && digest_required) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "No or too many KM_TAG_DIGEST");
-            *error = KM_ERROR_INVALID_ARGUMENT;
-            break;
-        }
+        const key_param_t *padding = provider_param(in_params, KM_TAG_PADDING, "KM_TAG_PADDING", error, func);
+        if (!padding)
+            return false;
+        const key_param_t *digest = digest_required
+                                        ? provider_param(in_params, KM_TAG_DIGEST, "KM_TAG_DIGEST", error, func)
+                                        : key_param_set_find_unique(in_params, KM_TAG_DIGEST);
+        if (!digest && digest_required)
+            return false;
         op->padding = padding->enumerated;
         op->digest = digest ? digest->enumerated : static_cast<uint32_t>(KM_DIGEST_NONE);
-        ok = true;
-    } while (false);
-    if (ok)
-        return op;
-    operation_destroy(header, record_state::partial);
+        return true;
+    });
+    if (header)
+        return operation_record<rsa_operation_t>(header);
+    // oom_error answers a missing record only; the steps set their own errors.
+    if (!allocated && oom_error)
+        *error = oom_error;
     return nullptr;
 }
 

@@ -123,6 +123,22 @@ enum class record_state : uint8_t {
 void operation_destroy(operation_t *op, record_state state = record_state::complete);
 
 /*
+ * operation_record_create - the frame of a provider's create: a new record
+ * of fns's kind, then steps(record), which makes its members and returns
+ * true when the record is ready. The record, or null when it cannot be
+ * allocated (logged "Out of memory" in func's name) or steps fail (the
+ * record and what steps made are released quietly).
+ */
+template <typename Record, typename Steps>
+operation_t *operation_record_create(const operation_fns_t *fns, const char *func, Steps steps) {
+    operation_t *header = operation_record_alloc(fns, func);
+    if (!header || steps(operation_record<Record>(header)))
+        return header;
+    operation_destroy(header, record_state::partial);
+    return nullptr;
+}
+
+/*
  * record_release - what a table's release function uses to free one member
  * at a time: each call frees the member when present and clears it; a
  * required member that is missing is logged when auditing.
@@ -285,10 +301,15 @@ TEE_Result provider_import_slot(keymaster_key_param_set_t *params, const uint8_t
                                 const char *func = __builtin_FUNCTION());
 
 /*
- * provider_key_size - the single KM_TAG_KEY_SIZE a generation needs: its
- * parameter, or null with "No or too many KM_TAG_KEY_SIZE or specified"
- * logged in func's name and *error -38.
+ * provider_param - the single parameter of tag that a step needs: the
+ * parameter, or null (absent or repeated) with "No or too many <what>"
+ * logged in func's name and *error missing_error.
  */
+const key_param_t *provider_param(const keymaster_key_param_set_t *params, uint32_t tag, const char *what,
+                                  int32_t *error, const char *func, int32_t missing_error = KM_ERROR_INVALID_ARGUMENT,
+                                  int line = __builtin_LINE());
+
+/* provider_key_size - provider_param for the single KM_TAG_KEY_SIZE a generation needs. */
 const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func);
 
 /*
