@@ -70,8 +70,7 @@ TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating,
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kAesKeys{
-    .label = "AES", .tee_type = TEE_TYPE_AES, .valid = valid_key_size, .vet = vet_aes};
+constexpr secret_key_family_t kAesKeys{.sizes = {"AES", valid_key_size}, .tee_type = TEE_TYPE_AES, .vet = vet_aes};
 
 // The TEE algorithm and nonce length of a block mode, and whether it takes PKCS#7.
 struct aes_mode_t {

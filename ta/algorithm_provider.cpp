@@ -143,12 +143,31 @@ const key_param_t *provider_param(const keymaster_key_param_set_t *params, uint3
     return p;
 }
 
-const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func) {
-    return provider_param(params, KM_TAG_KEY_SIZE, "KM_TAG_KEY_SIZE or specified", error, func);
+namespace {
+
+// The rule's refusal of bits, logged in func's name; false when it takes them.
+bool refused_size(const key_size_rule_t &rule, uint32_t bits, int32_t *error, const char *func) {
+    if (rule.valid(bits))
+        return false;
+    KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", rule.label, static_cast<int>(bits));
+    *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
+    return true;
 }
 
-TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,
-                                   const char *func) {
+} // namespace
+
+uint32_t provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, int32_t *error,
+                                  const char *func) {
+    const key_param_t *size = provider_param(params, KM_TAG_KEY_SIZE, "KM_TAG_KEY_SIZE or specified", error, func);
+    if (!size || refused_size(rule, size->integer, error, func))
+        return 0;
+    return size->integer;
+}
+
+namespace {
+
+// The import's size against the caller's KM_TAG_KEY_SIZE, as provider_import_size says.
+TEE_Result check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error, const char *func) {
     const key_param_t *size = key_param_set_find_unique(params, KM_TAG_KEY_SIZE);
     if (size) {
         if (size->integer == guessed)
@@ -161,6 +180,16 @@ TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t g
     TEE_Result res = key_param_set_add(params, key_param_enum(KM_TAG_KEY_SIZE, guessed));
     if (res != TEE_SUCCESS)
         KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");
+    return res;
+}
+
+} // namespace
+
+TEE_Result provider_import_size(keymaster_key_param_set_t *params, uint32_t bits, const key_size_rule_t &rule,
+                                int32_t *error, const char *func) {
+    TEE_Result res = check_key_size(params, bits, error, func);
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK)
+        refused_size(rule, bits, error, func);
     return res;
 }
 
@@ -216,28 +245,20 @@ TEE_Result provider_secret_key(uint32_t type, uint32_t key_size, uint8_t *dest, 
 }
 
 // The size in bits of raw key material of material_len bytes, to be stored
-// after `header` bytes: a length whose bits overflow, or that valid()
-// refuses, is "Invalid <label> key size %d" with *error -6; a
-// KM_TAG_KEY_SIZE that disagrees is refused as provider_check_key_size
-// says. True, with *bits, when usable.
+// after `header` bytes: a length whose bits overflow is "Invalid <label>
+// key size -1" with *error -6, else provider_import_size judges. True,
+// with *bits, when usable.
 bool provider_raw_key_size(keymaster_key_param_set_t *params, uint32_t material_len, uint32_t header,
-                           bool (*valid)(uint32_t), const char *label, uint32_t *bits, TEE_Result *res, int32_t *error,
+                           const key_size_rule_t &rule, uint32_t *bits, TEE_Result *res, int32_t *error,
                            const char *func) {
     if (material_len > (UINT32_MAX - header) / 8) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", label, -1);
+        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", rule.label, -1);
         *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
         return false;
     }
     *bits = material_len * 8;
-    *res = provider_check_key_size(params, *bits, error, func);
-    if (*res != TEE_SUCCESS || *error)
-        return false;
-    if (!valid(*bits)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", label, static_cast<int>(*bits));
-        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-        return false;
-    }
-    return true;
+    *res = provider_import_size(params, *bits, rule, error, func);
+    return *res == TEE_SUCCESS && *error == KM_ERROR_OK;
 }
 
 } // namespace
@@ -247,16 +268,9 @@ TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster
     return provider_key_slot(
         params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
         [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = provider_key_size(params, error, func);
-            if (!size)
+            const uint32_t bits = provider_generation_size(params, family.sizes, error, func);
+            if (!bits)
                 return false;
-            const uint32_t bits = size->integer;
-            if (!family.valid(bits)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid %s key size %d", family.label,
-                            static_cast<int>(bits));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
             uint32_t words[2] = {bits, family.tee_type};
             *res = family.vet(params, bits, true, &words[1], error, func);
             if (*res != TEE_SUCCESS || *error)
@@ -277,8 +291,8 @@ TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_k
         params, KM_ORIGIN_IMPORTED, key_data, key_data_len, error,
         [&](heap_buf *buf, TEE_Result *res) {
             uint32_t words[2] = {0, family.tee_type};
-            if (!provider_raw_key_size(params, material_len, 4 * header_words(family), family.valid, family.label,
-                                       &words[0], res, error, func))
+            if (!provider_raw_key_size(params, material_len, 4 * header_words(family), family.sizes, &words[0], res,
+                                       error, func))
                 return false;
             *res = family.vet(params, words[0], false, &words[1], error, func);
             if (*res != TEE_SUCCESS || *error)

@@ -52,12 +52,11 @@ bool read_values(byte_reader *r, ec_values_t *v, const char *func) {
     return true;
 }
 
-bool supported_size(uint32_t key_size, const char *func) {
-    if (curve_of(key_size))
-        return true;
-    KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Invalid EC key size %d", static_cast<int>(key_size));
-    return false;
+bool supported_size(uint32_t key_size) {
+    return curve_of(key_size) != nullptr;
 }
+
+constexpr key_size_rule_t kSizes{"EC", supported_size};
 
 } // namespace
 
@@ -65,14 +64,9 @@ TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data
                            int32_t *error) {
     return provider_key_slot(
         params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            const key_param_t *size = provider_key_size(params, error, "ec_generate_key");
-            if (!size)
+            const uint32_t key_size = provider_generation_size(params, kSizes, error, "ec_generate_key");
+            if (!key_size)
                 return false;
-            if (!supported_size(size->integer, "ec_generate_key")) {
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
-            const uint32_t key_size = size->integer;
             TEE_Attribute curve{};
             TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, curve_of(key_size)->curve, 0);
             *res = provider_generated_pair(TEE_TYPE_ECDSA_KEYPAIR, key_size, curve, kAttributeIds, kValues,
@@ -88,13 +82,9 @@ TEE_Result ec_import_key(keymaster_key_param_set_t *params, const uint8_t *mater
         params, material, material_len, key_data, key_data_len, error,
         [&](byte_reader *r) { return read_values(r, &v, "ec_import_key"); },
         [&](heap_buf *buf, TEE_Result *res, uint32_t consumed) {
-            *res = provider_check_key_size(params, v.key_size, error, "ec_import_key");
+            *res = provider_import_size(params, v.key_size, kSizes, error, "ec_import_key");
             if (*res != TEE_SUCCESS || *error)
                 return false;
-            if (!supported_size(v.key_size, "ec_import_key")) {
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
             // The key data is the material as read: bytes after the private value are not kept.
             *res = provider_key_data(buf, nullptr, 0, material, consumed, KM_ERROR_MEMORY_ALLOCATION_FAILED, error,
                                      "ec_import_key");

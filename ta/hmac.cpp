@@ -73,7 +73,7 @@ TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, 
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kHmacKeys{.label = "hmac", .tee_type = 0, .valid = valid_bit_length, .vet = vet_hmac};
+constexpr secret_key_family_t kHmacKeys{.sizes = {"hmac", valid_bit_length}, .tee_type = 0, .vet = vet_hmac};
 
 } // namespace
 

@@ -32,6 +32,8 @@ bool valid_key_size(uint32_t bits) {
     return bits % 8 == 0 && bits <= kRsaMaxKeyBits;
 }
 
+constexpr key_size_rule_t kSizes{"RSA", valid_key_size};
+
 struct digest_row_t {
     uint32_t digest;
     uint32_t length;
@@ -76,18 +78,9 @@ bool generation_params(const keymaster_key_param_set_t *params, uint64_t *expone
                                           error, "rsa_generate_key");
     if (!e)
         return false;
-    const key_param_t *size = provider_key_size(params, error, "rsa_generate_key");
-    if (!size)
-        return false;
-    if (!valid_key_size(size->integer)) {
-        KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_generate_key", __LINE__, "Invalid RSA key size %d",
-                    static_cast<int>(size->integer));
-        *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-        return false;
-    }
+    *key_size = provider_generation_size(params, kSizes, error, "rsa_generate_key");
     *exponent = e->long_integer;
-    *key_size = size->integer;
-    return true;
+    return *key_size != 0;
 }
 
 // Import's exponent rule: e must fit the tag's 64 bits, whether the tag is
@@ -147,15 +140,9 @@ TEE_Result rsa_import_key(keymaster_key_param_set_t *params, const uint8_t *mate
         [&](heap_buf *buf, TEE_Result *res, uint32_t consumed) {
             const uint64_t guessed64 = uint64_t{c.len[0]} * 8;
             const uint32_t guessed = guessed64 > UINT32_MAX ? UINT32_MAX : static_cast<uint32_t>(guessed64);
-            *res = provider_check_key_size(params, guessed, error, "rsa_import_key");
+            *res = provider_import_size(params, guessed, kSizes, error, "rsa_import_key");
             if (*res != TEE_SUCCESS || *error)
                 return false;
-            if (!valid_key_size(guessed)) {
-                KM_TRACE_AT(TEE_TRACE_ERROR, "rsa_import_key", __LINE__, "Invalid RSA key size %d",
-                            static_cast<int>(guessed));
-                *error = KM_ERROR_UNSUPPORTED_KEY_SIZE;
-                return false;
-            }
             *res = import_exponent(params, c, error);
             if (*res != TEE_SUCCESS || *error)
                 return false;

@@ -309,8 +309,23 @@ const key_param_t *provider_param(const keymaster_key_param_set_t *params, uint3
                                   int32_t *error, const char *func, int32_t missing_error = KM_ERROR_INVALID_ARGUMENT,
                                   int line = __builtin_LINE());
 
-/* provider_key_size - provider_param for the single KM_TAG_KEY_SIZE a generation needs. */
-const key_param_t *provider_key_size(const keymaster_key_param_set_t *params, int32_t *error, const char *func);
+/*
+ * key_size_rule_t - the key sizes of a family: which sizes valid() takes,
+ * and the label that names the family in "Invalid <label> key size %d".
+ */
+struct key_size_rule_t {
+    const char *label;
+    bool (*valid)(uint32_t bits);
+};
+
+/*
+ * provider_generation_size - the key size of a generation: the single
+ * KM_TAG_KEY_SIZE, when the rule takes it. Its bits, or 0 with the refusal
+ * logged in func's name: "No or too many KM_TAG_KEY_SIZE or specified"
+ * (*error -38) or "Invalid <label> key size %d" (*error -6).
+ */
+uint32_t provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, int32_t *error,
+                                  const char *func);
 
 /*
  * provider_generated_pair - the key data of a fresh key pair of TEE type
@@ -337,28 +352,28 @@ TEE_Result provider_key_data(heap_buf *buf, const uint32_t *words, uint32_t coun
                              uint32_t body_len, int32_t oom_error, int32_t *error, const char *func);
 
 /*
- * provider_check_key_size - an import's key size: the caller's
- * KM_TAG_KEY_SIZE must equal the size the material shows ("Key size
- * mismatch (given %d, guessed %d)", *error -44); without one, the guessed
- * size is added (TEE_ERROR_OUT_OF_MEMORY when the set cannot grow).
+ * provider_import_size - the key size an import's material shows (bits),
+ * checked: the caller's KM_TAG_KEY_SIZE must equal it ("Key size mismatch
+ * (given %d, guessed %d)", *error -44), and is added when there is none
+ * (TEE_ERROR_OUT_OF_MEMORY when the set cannot grow); then the rule
+ * ("Invalid <label> key size %d", *error -6). TEE_SUCCESS with *error 0
+ * when usable.
  */
-TEE_Result provider_check_key_size(keymaster_key_param_set_t *params, uint32_t guessed, int32_t *error,
-                                   const char *func = __builtin_FUNCTION());
+TEE_Result provider_import_size(keymaster_key_param_set_t *params, uint32_t bits, const key_size_rule_t &rule,
+                                int32_t *error, const char *func);
 
 /*
  * secret_key_family_t - what the key slots of a raw secret-key family
  * (AES, HMAC) differ in. Key data: the key size as a u32, then, for a
  * family without one tee_type, each key's TEE type as a u32, then the key
- * bytes. label names the family in "Invalid %s key size %d"; valid()
- * takes its sizes; vet() checks the other parameters for a key of bits
+ * bytes. sizes are its key sizes; vet() checks the other parameters for a key of bits
  * (for generation or import), sets the key's TEE type when the family
  * has none, and sets *error or returns the TEE's result when they will
  * not do.
  */
 struct secret_key_family_t {
-    const char *label;
+    key_size_rule_t sizes;
     uint32_t tee_type; // 0: each key has its own
-    bool (*valid)(uint32_t bits);
     TEE_Result (*vet)(keymaster_key_param_set_t *params, uint32_t bits, bool generating, uint32_t *tee_type,
                       int32_t *error, const char *func);
 };
