@@ -70,7 +70,11 @@ TEE_Result vet_aes(keymaster_key_param_set_t *params, uint32_t, bool generating,
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kAesKeys{.sizes = {"AES", valid_key_size}, .tee_type = TEE_TYPE_AES, .vet = vet_aes};
+constexpr secret_key_family_t kAesKeys{.sizes = {"AES", valid_key_size},
+                                       .tee_type = TEE_TYPE_AES,
+                                       .vet = vet_aes,
+                                       .generate_name = "aes_generate_key",
+                                       .import_name = "aes_import_key"};
 
 // The TEE algorithm and nonce length of a block mode, and whether it takes PKCS#7.
 struct aes_mode_t {
@@ -173,15 +177,8 @@ bool hold_back_buffer(uint8_t **buf, uint32_t len, int32_t *error, const char *f
 
 } // namespace
 
-TEE_Result aes_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                            int32_t *error) {
-    return provider_generate_secret(kAesKeys, params, key_data, key_data_len, error);
-}
-
-TEE_Result aes_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                          uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_import_secret(kAesKeys, params, material, material_len, key_data, key_data_len, error);
-}
+generate_key_fn &aes_generate_key = secret_generate_key<kAesKeys>;
+import_key_fn &aes_import_key = secret_import_key<kAesKeys>;
 
 TEE_Result aes_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
                                 uint32_t *key_size, int32_t *error) {

@@ -73,7 +73,11 @@ TEE_Result vet_hmac(keymaster_key_param_set_t *params, uint32_t key_size, bool, 
     return TEE_SUCCESS;
 }
 
-constexpr secret_key_family_t kHmacKeys{.sizes = {"hmac", valid_bit_length}, .tee_type = 0, .vet = vet_hmac};
+constexpr secret_key_family_t kHmacKeys{.sizes = {"hmac", valid_bit_length},
+                                        .tee_type = 0,
+                                        .vet = vet_hmac,
+                                        .generate_name = "hmac_generate_key",
+                                        .import_name = "hmac_import_key"};
 
 } // namespace
 
@@ -84,15 +88,8 @@ uint32_t hmac_algorithm_for_key_type(uint32_t key_type) {
     return 0;
 }
 
-TEE_Result hmac_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
-                             int32_t *error) {
-    return provider_generate_secret(kHmacKeys, params, key_data, key_data_len, error);
-}
-
-TEE_Result hmac_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
-                           uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
-    return provider_import_secret(kHmacKeys, params, material, material_len, key_data, key_data_len, error);
-}
+generate_key_fn &hmac_generate_key = secret_generate_key<kHmacKeys>;
+import_key_fn &hmac_import_key = secret_import_key<kHmacKeys>;
 
 TEE_Result hmac_resolve_key_data(const uint8_t *key_data, uint32_t key_data_len, TEE_ObjectHandle *object,
                                  uint32_t *key_size, uint32_t *key_type, int32_t *error) {

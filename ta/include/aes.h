@@ -11,13 +11,14 @@
 constexpr uint32_t kAesBlock = 16;
 
 /*
- * aes_generate_key / aes_import_key - the provider's key slots: the
- * parameters are checked and completed (origin, key size), the key data
- * returned in a buffer the caller frees. Refusals set *error; generation
- * reports no memory as TEE_ERROR_OUT_OF_MEMORY, import as error -41.
+ * aes_generate_key / aes_import_key - the provider's key slots, the AES
+ * family's secret_generate_key and secret_import_key: the parameters are
+ * checked and completed (origin, key size), the key data returned in a
+ * buffer the caller frees. Refusals set *error; generation reports no
+ * memory as TEE_ERROR_OUT_OF_MEMORY, import as error -41.
  */
-generate_key_fn aes_generate_key;
-import_key_fn aes_import_key;
+extern generate_key_fn &aes_generate_key;
+extern import_key_fn &aes_import_key;
 
 /*
  * aes_resolve_key_data - a TEE AES key object from key data. On success

@@ -366,7 +366,8 @@ TEE_Result provider_import_size(keymaster_key_param_set_t *params, uint32_t bits
  * secret_key_family_t - what the key slots of a raw secret-key family
  * (AES, HMAC) differ in. Key data: the key size as a u32, then, for a
  * family without one tee_type, each key's TEE type as a u32, then the key
- * bytes. sizes are its key sizes; vet() checks the other parameters for a key of bits
+ * bytes. sizes are its key sizes, generate_name and import_name its slots'
+ * names in log lines; vet() checks the other parameters for a key of bits
  * (for generation or import), sets the key's TEE type when the family
  * has none, and sets *error or returns the TEE's result when they will
  * not do.
@@ -376,6 +377,8 @@ struct secret_key_family_t {
     uint32_t tee_type; // 0: each key has its own
     TEE_Result (*vet)(keymaster_key_param_set_t *params, uint32_t bits, bool generating, uint32_t *tee_type,
                       int32_t *error, const char *func);
+    const char *generate_name;
+    const char *import_name;
 };
 
 /*
@@ -392,6 +395,23 @@ TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster
 TEE_Result provider_import_secret(const secret_key_family_t &family, keymaster_key_param_set_t *params,
                                   const uint8_t *material, uint32_t material_len, uint8_t **key_data,
                                   uint32_t *key_data_len, int32_t *error, const char *func = __builtin_FUNCTION());
+
+/*
+ * secret_generate_key / secret_import_key - the generate and import slots
+ * of a secret-key family's provider table: provider_generate_secret and
+ * provider_import_secret with the family, logged in the family's names.
+ */
+template <const secret_key_family_t &Family>
+TEE_Result secret_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data, uint32_t *key_data_len,
+                               int32_t *error) {
+    return provider_generate_secret(Family, params, key_data, key_data_len, error, Family.generate_name);
+}
+template <const secret_key_family_t &Family>
+TEE_Result secret_import_key(keymaster_key_param_set_t *params, const uint8_t *material, uint32_t material_len,
+                             uint8_t **key_data, uint32_t *key_data_len, int32_t *error) {
+    return provider_import_secret(Family, params, material, material_len, key_data, key_data_len, error,
+                                  Family.import_name);
+}
 
 /*
  * provider_resolve_secret - the family's key data as a new TEE object the

@@ -9,12 +9,13 @@
 #include "keymaster_defs.h"
 
 /*
- * hmac_generate_key / hmac_import_key - the provider's key slots: the
- * parameters are checked and completed (origin, key size), the key data
- * returned in a buffer the caller frees. Refusals set *error.
+ * hmac_generate_key / hmac_import_key - the provider's key slots, the HMAC
+ * family's secret_generate_key and secret_import_key: the parameters are
+ * checked and completed (origin, key size), the key data returned in a
+ * buffer the caller frees. Refusals set *error.
  */
-generate_key_fn hmac_generate_key;
-import_key_fn hmac_import_key;
+extern generate_key_fn &hmac_generate_key;
+extern import_key_fn &hmac_import_key;
 
 /*
  * hmac_resolve_key_data - a TEE key object from HMAC key data. On success
