@@ -191,10 +191,8 @@ operation_t *aes_operation_create(const uint8_t *key_data, uint32_t key_data_len
     const bool decrypting = mode == TEE_MODE_DECRYPT;
     operation_t *header = operation_record_create<aes_operation_t>(fns, func, [&](aes_operation_t *op) {
         TEE_Result res = aes_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        if (!operation_key_resolved(res, error, &op->key, func))
             return false;
-        }
         if (!read_begin_params(op, in_params, error, func))
             return false;
         if (decrypting && op->block_mode == KM_MODE_GCM &&

@@ -341,6 +341,14 @@ TEE_Result provider_set_origin(keymaster_key_param_set_t *params, uint32_t origi
     return res;
 }
 
+bool operation_key_resolved(TEE_Result res, const int32_t *error, const TEE_ObjectHandle *key, const char *func,
+                            int line) {
+    if (res == TEE_SUCCESS && *error == KM_ERROR_OK && *key)
+        return true;
+    KM_TRACE_AT(TEE_TRACE_ERROR, func, line, "Resolve key data failed");
+    return false;
+}
+
 operation_t *operation_record_alloc(const operation_fns_t *fns, const char *func) {
     auto *op = static_cast<operation_t *>(ta_malloc(fns->record_size));
     if (!op) {

@@ -199,10 +199,9 @@ uint32_t message_room(const ec_operation_t *op) {
 operation_t *ec_operation_create(const uint8_t *key_data, uint32_t key_data_len, keymaster_key_param_set_t *in_params,
                                  uint32_t mode, int32_t *error, const operation_fns_t *fns, const char *func) {
     return operation_record_create<ec_operation_t>(fns, func, [&](ec_operation_t *op) {
-        if (ec_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS || !op->key) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        TEE_Result res = ec_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error);
+        if (!operation_key_resolved(res, error, &op->key, func))
             return false;
-        }
         const key_param_t *digest = provider_param(in_params, KM_TAG_DIGEST, "KM_TAG_DIGEST", error, func);
         if (!digest)
             return false;

@@ -102,10 +102,8 @@ operation_t *hmac_operation_create(const uint8_t *key_data, uint32_t key_data_le
     operation_t *header = operation_record_create<hmac_operation_t>(fns, func, [&](hmac_operation_t *op) {
         uint32_t key_type = 0;
         TEE_Result res = hmac_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, &key_type, error);
-        if (res != TEE_SUCCESS || *error) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        if (!operation_key_resolved(res, error, &op->key, func))
             return false;
-        }
         const key_param_t *mac_length = provider_param(in_params, KM_TAG_MAC_LENGTH, "KM_TAG_MAC_LENGTH", error, func);
         if (!mac_length)
             return false;

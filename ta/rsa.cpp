@@ -218,10 +218,9 @@ rsa_operation_t *rsa_record_start(const uint8_t *key_data, uint32_t key_data_len
     bool allocated = false;
     operation_t *header = operation_record_create<rsa_operation_t>(fns, func, [&](rsa_operation_t *op) {
         allocated = true;
-        if (rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error) != TEE_SUCCESS) {
-            KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Resolve key data failed");
+        TEE_Result res = rsa_resolve_key_data(key_data, key_data_len, &op->key, &op->key_size, error);
+        if (!operation_key_resolved(res, error, &op->key, func))
             return false;
-        }
         op->block = static_cast<uint8_t *>(ta_malloc(op->key_size / 8));
         if (!op->block) {
             KM_TRACE_AT(TEE_TRACE_ERROR, func, __LINE__, "Out of memory");

@@ -139,6 +139,14 @@ operation_t *operation_record_create(const operation_fns_t *fns, const char *fun
 }
 
 /*
+ * operation_key_resolved - whether a create's key resolution, which
+ * answered res and *error, left it a key in *key; when not, "Resolve key
+ * data failed" is logged in func's name.
+ */
+bool operation_key_resolved(TEE_Result res, const int32_t *error, const TEE_ObjectHandle *key, const char *func,
+                            int line = __builtin_LINE());
+
+/*
  * record_release - what a table's release function uses to free one member
  * at a time: each call frees the member when present and clears it; a
  * required member that is missing is logged when auditing.
