@@ -16,6 +16,7 @@
 #include "km/names.h"
 #include "ta_entry.h"
 #include "ta_fixture.h"
+#include "scratch_dir.h"
 
 namespace {
 
@@ -492,16 +493,8 @@ TEST(ClientWire, MalformedAnswers) {
 
 class EmbeddedClient : public ::testing::Test {
   protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/km-client-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-    }
-    void TearDown() override {
-        std::error_code ec;
-        std::filesystem::remove_all(dir_, ec);
-    }
-    std::filesystem::path dir_;
+    ScratchDir scratch_{"km-client"};
+    const std::filesystem::path &dir_ = scratch_.path();
 };
 
 TEST_F(EmbeddedClient, AnswersFromTheTa) {

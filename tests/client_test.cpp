@@ -29,6 +29,7 @@
 #include "km/param_text.h"
 #include "ta_entry.h"
 #include "ta_fixture.h"
+#include "scratch_dir.h"
 
 namespace {
 
@@ -891,18 +892,9 @@ TEST(ClientStream, EveryWayOutEndsTheOperation) {
 class EmbeddedKeys : public ::testing::Test {
   protected:
     void SetUp() override {
-        char tmpl[] = "/tmp/km-client-keys-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
         tee_ = std::make_unique<km::EmbeddedTee>(dir_ / "state", 0);
         ASSERT_EQ(tee_->open(), TEE_SUCCESS);
         client_ = std::make_unique<km::Client>(*tee_);
-    }
-    void TearDown() override {
-        client_.reset();
-        tee_.reset();
-        std::error_code ec;
-        std::filesystem::remove_all(dir_, ec);
     }
     static ParamSet hmac_key(uint32_t min_mac = 128) {
         ParamSet s;
@@ -914,7 +906,9 @@ class EmbeddedKeys : public ::testing::Test {
             .add_bool(KM_TAG_NO_AUTH_REQUIRED);
         return s;
     }
-    std::filesystem::path dir_;
+    // Declared first, so that the directory goes after the TEE using it.
+    ScratchDir scratch_{"km-client-keys"};
+    const std::filesystem::path &dir_ = scratch_.path();
     std::unique_ptr<km::EmbeddedTee> tee_;
     std::unique_ptr<km::Client> client_;
 };

@@ -21,6 +21,7 @@
 #include "rsa_keys.h"
 #include "soter_keys.h"
 #include "ta_entry.h"
+#include "scratch_dir.h"
 
 namespace {
 
@@ -85,16 +86,6 @@ Bytes counter_object() {
 
 class CrashSafety : public ::testing::Test {
   protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/crash-safety-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     // in_child - runs body in a child process with a power cut armed at the
     // nth atomic write to reach point; the child's exit status (the cut's
     // code when it happened, 0 when body ran to its end, 1 when it failed).
@@ -120,15 +111,15 @@ class CrashSafety : public ::testing::Test {
         return p;
     }
 
-    fs::path dir_;
+    ScratchDir scratch_{"crash-safety"};
+    const fs::path &dir_ = scratch_.path();
 };
 
 // The key-store key is written when the TA first starts on a directory.
 TEST_F(CrashSafety, KeyStoreKeyCreation) {
     for (crash::Point p : kPoints) {
         SCOPED_TRACE(name(p));
-        TearDown();
-        SetUp();
+        scratch_.renew("crash-safety");
         EXPECT_EQ(in_child(p, 1,
                            [&] {
                                Bytes b;

@@ -17,6 +17,7 @@
 #include "cli_files.h"
 #include "rsa_keys.h"
 #include "soter_keys.h"
+#include "scratch_dir.h"
 
 namespace {
 
@@ -42,17 +43,6 @@ void spit(const fs::path &p, const std::string &data) {
 
 class KmctlSoter : public ::testing::Test {
   protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/kmctl-soter-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-        state_ = dir_ / "state";
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     // kmctl with the test's state directory; stdout and stderr captured.
     CliRun kmctl(const std::string &args) {
         std::string cmd = std::string("'") + KMCTL_PATH + "' --state '" + state_.string() + "' --log-level none " +
@@ -66,8 +56,9 @@ class KmctlSoter : public ::testing::Test {
     }
     std::string path(const char *name) { return (dir_ / name).string(); }
 
-    fs::path dir_;
-    fs::path state_;
+    ScratchDir scratch_{"kmctl-soter"};
+    const fs::path &dir_ = scratch_.path();
+    const fs::path state_ = dir_ / "state";
 };
 
 TEST_F(KmctlSoter, NewStateIsNotProvisioned) {

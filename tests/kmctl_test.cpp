@@ -23,6 +23,8 @@
 #include <openssl/pem.h>
 #include <openssl/x509.h>
 
+#include "scratch_dir.h"
+
 extern char **environ;
 
 namespace {
@@ -229,17 +231,6 @@ Table parse_table(const std::string &text, std::vector<std::string> *order) {
 
 class Kmctl : public ::testing::Test {
   protected:
-    void SetUp() override {
-        char tmpl[] = "/tmp/kmctl-test-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
-        state_ = dir_ / "state";
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     // run - kmctl with args, its environment changed by env (an empty
     // value removes the variable), its stdin read from stdin_file.
     CliRun run(const std::vector<std::string> &args, const std::map<std::string, std::string> &env = {},
@@ -294,8 +285,9 @@ class Kmctl : public ::testing::Test {
         return run(args);
     }
 
-    fs::path dir_;
-    fs::path state_;
+    ScratchDir scratch_{"kmctl-test"};
+    const fs::path &dir_ = scratch_.path();
+    const fs::path state_ = dir_ / "state";
 };
 
 const std::string kShaFamily = "md5, sha1, sha_2_224, sha_2_256, sha_2_384, sha_2_512";

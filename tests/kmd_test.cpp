@@ -44,6 +44,7 @@
 #include "km/kmd_protocol.h"
 #include "km/socket_transport.h"
 #include "rsa_keys.h"
+#include "scratch_dir.h"
 #include "soter_keys.h"
 #include "ta_entry.h"
 #include "tee_host.h"
@@ -59,20 +60,6 @@ using km::ParamSet;
 using namespace std::chrono_literals;
 
 constexpr auto kDeadline = 60s; // generous: the ASan build on a loaded machine
-
-struct TempDir {
-    fs::path path;
-    TempDir() {
-        std::string tmpl = (fs::temp_directory_path() / "kmd-test-XXXXXX").string();
-        if (!mkdtemp(tmpl.data()))
-            throw std::runtime_error("mkdtemp failed");
-        path = tmpl;
-    }
-    ~TempDir() {
-        std::error_code ec;
-        fs::remove_all(path, ec);
-    }
-};
 
 std::string read_file(const fs::path &p) {
     std::ifstream in(p, std::ios::binary);
@@ -413,9 +400,9 @@ class KmdTest : public ::testing::Test {
         EXPECT_EQ(tee_host::handles::leaked_at_last_destroy(), 0u);
         EXPECT_FALSE(fs::exists(socket()));
     }
-    fs::path state() const { return dir_.path / "state"; }
-    fs::path socket() const { return dir_.path / "kmd.sock"; }
-    TempDir dir_;
+    fs::path state() const { return dir_.path() / "state"; }
+    fs::path socket() const { return dir_.path() / "kmd.sock"; }
+    ScratchDir dir_{"kmd-test"};
 };
 
 TEST_F(KmdTest, UsesPerBootAndRateLimitsHoldAcrossConnectionsUntilRestart) {
@@ -684,7 +671,7 @@ TEST_F(KmdTest, OnlyItsOwnUserAndThoseAllowedMayConnect) {
         GTEST_SKIP() << "needs root to connect as another user";
     constexpr uid_t kOther = 65534;
     // Where another user can reach the socket file at all.
-    fs::permissions(dir_.path, fs::perms::owner_all | fs::perms::others_exec | fs::perms::group_exec);
+    fs::permissions(dir_.path(), fs::perms::owner_all | fs::perms::others_exec | fs::perms::group_exec);
     auto connect_as_other = [&]() -> int {
         pid_t pid = fork();
         if (pid == 0) {
@@ -716,7 +703,7 @@ TEST_F(KmdTest, OnlyItsOwnUserAndThoseAllowedMayConnect) {
 // ---- the daemon as users meet it ----
 
 TEST_F(KmdTest, DefaultSocketIsPrivateAndTheStateDirectoryHasOneTee) {
-    const fs::path runtime = dir_.path / "run";
+    const fs::path runtime = dir_.path() / "run";
     fs::create_directory(runtime);
     const fs::path sock = runtime / "kmd" / "kmd.sock";
     const std::string env = "XDG_RUNTIME_DIR=" + runtime.string();
@@ -731,7 +718,7 @@ TEST_F(KmdTest, DefaultSocketIsPrivateAndTheStateDirectoryHasOneTee) {
     EXPECT_EQ(st.st_mode & 07777, 0600u);
 
     // A second kmd and an embedded kmctl both refuse, naming the socket.
-    const fs::path err = dir_.path / "err";
+    const fs::path err = dir_.path() / "err";
     pid_t second = spawn({KMD_PATH, "--foreground", "--state", state().string()}, err, nullptr, {env});
     EXPECT_EQ(exit_code(second), 1);
     EXPECT_NE(read_file(err).find("another kmd serves the state directory " + state().string() + " on the socket " +
@@ -746,7 +733,7 @@ TEST_F(KmdTest, DefaultSocketIsPrivateAndTheStateDirectoryHasOneTee) {
         << read_file(err);
 
     // kmctl through kmd, by environment and by option.
-    const fs::path blob = dir_.path / "k.blob", msg = dir_.path / "msg", mac = dir_.path / "mac";
+    const fs::path blob = dir_.path() / "k.blob", msg = dir_.path() / "msg", mac = dir_.path() / "mac";
     std::ofstream(msg) << "through kmd";
     pid_t gen = spawn({KMCTL_PATH, "generate", "--algorithm", "hmac", "--size", "256", "--digest", "sha256",
                        "--min-mac-length", "256", "--out", blob.string()},
@@ -796,7 +783,7 @@ TEST_F(KmdTest, ASocketLeftByAKilledKmdIsReplacedAndVersionIsPrinted) {
     EXPECT_NE(fgets(line, sizeof line, version), nullptr);
     EXPECT_EQ(pclose(version), 0);
     EXPECT_STREQ(line, "kmd 0.1.0\n");
-    pid_t usage = spawn({KMD_PATH, "--state", ""}, dir_.path / "err");
+    pid_t usage = spawn({KMD_PATH, "--state", ""}, dir_.path() / "err");
     EXPECT_EQ(exit_code(usage), 2);
 }
 
@@ -1005,7 +992,7 @@ TEST_F(KmdTest, StoppingAbortsLiveOperationsAndEndsTheTaCleanly) {
 // ---- embedded kmctl runs on one state directory ----
 
 TEST_F(KmdTest, ASecondEmbeddedKmctlWaitsForTheFirst) {
-    const fs::path err = dir_.path / "err", key = dir_.path / "k.blob", fifo = dir_.path / "in";
+    const fs::path err = dir_.path() / "err", key = dir_.path() / "k.blob", fifo = dir_.path() / "in";
     const std::vector<std::string> no_socket = {"KMCTL_SOCKET"};
     pid_t gen = spawn({KMCTL_PATH, "--state", state().string(), "generate", "--algorithm", "hmac", "--size", "256",
                        "--digest", "sha256", "--min-mac-length", "256", "--out", key.string()},
@@ -1016,7 +1003,7 @@ TEST_F(KmdTest, ASecondEmbeddedKmctlWaitsForTheFirst) {
     // The first holds the directory while it waits for its input.
     int first_err = -1;
     pid_t first = spawn({KMCTL_PATH, "--state", state().string(), "--log-level", "info", "sign", "--key", key.string(),
-                         "--in", fifo.string(), "--out", (dir_.path / "mac1").string()},
+                         "--in", fifo.string(), "--out", (dir_.path() / "mac1").string()},
                         {}, &first_err, {}, no_socket);
     int input = open(fifo.c_str(), O_WRONLY | O_CLOEXEC);
     ASSERT_GE(input, 0);
@@ -1025,7 +1012,7 @@ TEST_F(KmdTest, ASecondEmbeddedKmctlWaitsForTheFirst) {
 
     int second_err = -1;
     pid_t second = spawn({KMCTL_PATH, "--state", state().string(), "generate", "--algorithm", "hmac", "--size", "256",
-                          "--digest", "sha256", "--min-mac-length", "256", "--out", (dir_.path / "k2.blob").string()},
+                          "--digest", "sha256", "--min-mac-length", "256", "--out", (dir_.path() / "k2.blob").string()},
                          {}, &second_err, {}, no_socket);
     std::string second_text;
     EXPECT_TRUE(read_until(second_err, &second_text,
@@ -1033,14 +1020,14 @@ TEST_F(KmdTest, ASecondEmbeddedKmctlWaitsForTheFirst) {
         << second_text;
     int status = 0;
     EXPECT_EQ(waitpid(second, &status, WNOHANG), 0) << "the second ran while the first held the directory";
-    EXPECT_FALSE(fs::exists(dir_.path / "k2.blob"));
+    EXPECT_FALSE(fs::exists(dir_.path() / "k2.blob"));
 
     ASSERT_EQ(write(input, "message", 7), 7);
     close(input);
     EXPECT_EQ(exit_code(first), 0) << first_text;
     EXPECT_EQ(exit_code(second), 0) << second_text;
-    EXPECT_TRUE(fs::exists(dir_.path / "k2.blob"));
-    EXPECT_EQ(read_file(dir_.path / "mac1").size(), 32u);
+    EXPECT_TRUE(fs::exists(dir_.path() / "k2.blob"));
+    EXPECT_EQ(read_file(dir_.path() / "mac1").size(), 32u);
     close(first_err);
     close(second_err);
 }
@@ -1054,13 +1041,13 @@ TEST_F(KmdTest, EmbeddedKmctlsStartedTogetherMakeOneKeyStoreKey) {
             std::vector<std::string> argv = {KMCTL_PATH, "--state", state().string()};
             for (std::string &a : args(i))
                 argv.push_back(a);
-            pids.push_back(spawn(argv, dir_.path / ("err" + std::to_string(i)), nullptr, {}, no_socket));
+            pids.push_back(spawn(argv, dir_.path() / ("err" + std::to_string(i)), nullptr, {}, no_socket));
         }
         for (int i = 0; i < kRuns; ++i)
-            EXPECT_EQ(exit_code(pids[i]), 0) << read_file(dir_.path / ("err" + std::to_string(i)));
+            EXPECT_EQ(exit_code(pids[i]), 0) << read_file(dir_.path() / ("err" + std::to_string(i)));
     };
-    auto key = [&](int i) { return (dir_.path / ("k" + std::to_string(i))).string(); };
-    std::ofstream(dir_.path / "msg") << "message";
+    auto key = [&](int i) { return (dir_.path() / ("k" + std::to_string(i))).string(); };
+    std::ofstream(dir_.path() / "msg") << "message";
     all_at_once([&](int i) {
         return std::vector<std::string>{"generate", "--algorithm",      "hmac", "--size", "256", "--digest",
                                         "sha256",   "--min-mac-length", "256",  "--out",  key(i)};
@@ -1077,7 +1064,7 @@ TEST_F(KmdTest, EmbeddedKmctlsStartedTogetherMakeOneKeyStoreKey) {
         files.push_back(entry.path().filename().string());
     EXPECT_EQ(files, std::vector<std::string>{ksk_name + ".obj"});
     all_at_once([&](int i) {
-        return std::vector<std::string>{"sign",  "--key",        key(i), "--in", (dir_.path / "msg").string(),
+        return std::vector<std::string>{"sign",  "--key",        key(i), "--in", (dir_.path() / "msg").string(),
                                         "--out", key(i) + ".mac"};
     });
     for (int i = 0; i < kRuns; ++i)

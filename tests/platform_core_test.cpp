@@ -9,6 +9,7 @@
 #include <fstream>
 #include <thread>
 
+#include "scratch_dir.h"
 #include "ta_entry.h"
 #include "ta_fixture.h"
 
@@ -388,18 +389,16 @@ TEST_F(Platform, DeviceIdIsKeptPerStateDirectory) {
     EXPECT_EQ(property(s, "tee", "gpd.tee.deviceID"), first);
     tee_->close_session(s);
 
-    char tmpl[] = "/tmp/km-other-XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    ScratchDir other_dir("km-other");
     stop();
     tee_host::Config other;
-    other.state_dir = tmpl;
+    other.state_dir = other_dir.path();
     start(other);
     tee_->install_ta(&kProbeHeader);
     s = open_probe(tee_host::normal_world_identity());
     EXPECT_NE(property(s, "tee", "gpd.tee.deviceID"), first);
     tee_->close_session(s);
     stop();
-    std::filesystem::remove_all(tmpl);
     start();
 }
 

@@ -5,22 +5,11 @@
  */
 #include <cstring>
 
-#include "ta_fixture.h"
+#include "gp_handles.h"
 
 namespace {
 
 class Objects : public TeeTest {};
-
-struct Obj {
-    TEE_ObjectHandle h = TEE_HANDLE_NULL;
-    Obj(uint32_t type, uint32_t max_bits) {
-        EXPECT_EQ(TEE_AllocateTransientObject(type, max_bits, &h), TEE_SUCCESS) << std::hex << type;
-    }
-    ~Obj() { TEE_FreeTransientObject(h); }
-    Obj(const Obj &) = delete;
-    Obj &operator=(const Obj &) = delete;
-    operator TEE_ObjectHandle() const { return h; }
-};
 
 TEE_Result populate_secret(TEE_ObjectHandle h, const Bytes &secret) {
     TEE_Attribute a{};

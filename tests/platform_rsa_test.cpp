@@ -20,7 +20,7 @@
 #include <openssl/rsa.h>
 #include <openssl/x509.h>
 
-#include "ta_fixture.h"
+#include "gp_handles.h"
 
 namespace {
 
@@ -180,22 +180,11 @@ struct CtxFree {
     void operator()(EVP_PKEY_CTX *c) const { EVP_PKEY_CTX_free(c); }
 };
 using Ctx = std::unique_ptr<EVP_PKEY_CTX, CtxFree>;
-using Attrs = std::vector<std::pair<uint32_t, Bytes>>;
 using AttrList = std::vector<TEE_Attribute>;
-
-uint32_t u32(size_t n) {
-    return static_cast<uint32_t>(n);
-}
-Bytes text(const char *s) {
-    return Bytes(s, s + std::strlen(s));
-}
 
 Bytes random_bytes(size_t n) {
     static std::mt19937 rng(2024);
-    Bytes b(n);
-    for (auto &x : b)
-        x = static_cast<uint8_t>(rng());
-    return b;
+    return ::random_bytes(rng, n);
 }
 
 Bytes left_pad(const Bytes &b, size_t k) {
@@ -250,56 +239,6 @@ const TestKey &fixed_key(uint32_t bits) {
 }
 
 // --- Platform handles, freed at scope exit -----------------------------------------
-
-struct Obj {
-    TEE_ObjectHandle h = TEE_HANDLE_NULL;
-    Obj(uint32_t type, uint32_t max_bits) { EXPECT_EQ(TEE_AllocateTransientObject(type, max_bits, &h), TEE_SUCCESS); }
-    Obj(uint32_t type, uint32_t max_bits, const Attrs &attrs) : Obj(type, max_bits) {
-        EXPECT_EQ(populate(attrs), TEE_SUCCESS);
-    }
-    ~Obj() { TEE_FreeTransientObject(h); }
-    Obj(const Obj &) = delete;
-    Obj &operator=(const Obj &) = delete;
-    operator TEE_ObjectHandle() const { return h; }
-
-    TEE_Result populate(const Attrs &attrs) {
-        AttrList v(attrs.size());
-        for (size_t i = 0; i < attrs.size(); ++i)
-            TEE_InitRefAttribute(&v[i], attrs[i].first, attrs[i].second.data(), u32(attrs[i].second.size()));
-        return TEE_PopulateTransientObject(h, v.data(), u32(v.size()));
-    }
-    Bytes get(uint32_t id) const {
-        Bytes out(1100);
-        uint32_t len = u32(out.size());
-        EXPECT_EQ(TEE_GetObjectBufferAttribute(h, id, out.data(), &len), TEE_SUCCESS) << std::hex << id;
-        out.resize(len);
-        return out;
-    }
-    TEE_ObjectInfo info() const {
-        TEE_ObjectInfo i{};
-        EXPECT_EQ(TEE_GetObjectInfo1(h, &i), TEE_SUCCESS);
-        return i;
-    }
-};
-
-struct Op {
-    TEE_OperationHandle h = TEE_HANDLE_NULL;
-    Op(uint32_t alg, uint32_t mode, uint32_t max_bits, TEE_ObjectHandle key = TEE_HANDLE_NULL) {
-        EXPECT_EQ(TEE_AllocateOperation(&h, alg, mode, max_bits), TEE_SUCCESS) << std::hex << alg << " mode " << mode;
-        if (key) {
-            EXPECT_EQ(TEE_SetOperationKey(h, key), TEE_SUCCESS);
-        }
-    }
-    ~Op() { TEE_FreeOperation(h); }
-    Op(const Op &) = delete;
-    Op &operator=(const Op &) = delete;
-    operator TEE_OperationHandle() const { return h; }
-    TEE_OperationInfo info() const {
-        TEE_OperationInfo i{};
-        TEE_GetOperationInfo(h, &i);
-        return i;
-    }
-};
 
 TEE_Attribute salt_attr(uint32_t v) {
     TEE_Attribute a{};
@@ -472,12 +411,12 @@ TEST_F(Rsa, PopulatedKeysReadBackMinimalComponentsAtEverySize) {
         Obj pair(TEE_TYPE_RSA_KEYPAIR, bits + 16, padded);
         EXPECT_EQ(pair.info().objectSize, bits);
         for (const auto &[id, v] : key.all)
-            EXPECT_EQ(pair.get(id), v) << std::hex << id;
+            EXPECT_EQ(pair.buffer(id), v) << std::hex << id;
 
         Obj pub(TEE_TYPE_RSA_PUBLIC_KEY, bits, key.pub());
         EXPECT_EQ(pub.info().objectSize, bits);
-        EXPECT_EQ(pub.get(TEE_ATTR_RSA_MODULUS), key.n());
-        EXPECT_EQ(pub.get(TEE_ATTR_RSA_PUBLIC_EXPONENT), hex("010001"));
+        EXPECT_EQ(pub.buffer(TEE_ATTR_RSA_MODULUS), key.n());
+        EXPECT_EQ(pub.buffer(TEE_ATTR_RSA_PUBLIC_EXPONENT), hex("010001"));
         uint32_t len = 0;
         EXPECT_EQ(TEE_GetObjectBufferAttribute(pub, TEE_ATTR_RSA_PRIVATE_EXPONENT, nullptr, &len),
                   TEE_ERROR_ITEM_NOT_FOUND);
@@ -579,19 +518,19 @@ TEST_F(Rsa, GeneratedKeysAreCompleteAndWork) {
         TEE_InitRefAttribute(&e, TEE_ATTR_RSA_PUBLIC_EXPONENT, c.exponent.data(), u32(c.exponent.size()));
         ASSERT_EQ(TEE_GenerateKey(o, c.bits, &e, c.exponent.empty() ? 0 : 1), TEE_SUCCESS);
         EXPECT_EQ(o.info().objectSize, c.bits);
-        EXPECT_EQ(o.get(TEE_ATTR_RSA_PUBLIC_EXPONENT), c.want_e);
+        EXPECT_EQ(o.buffer(TEE_ATTR_RSA_PUBLIC_EXPONENT), c.want_e);
 
         // The eight components describe one valid key, as OpenSSL checks it.
         OSSL_PARAM_BLD *bld = OSSL_PARAM_BLD_new();
         std::vector<BIGNUM *> bns;
         for (size_t i = 0; i < std::size(kComponentIds); ++i) {
-            Bytes v = o.get(kComponentIds[i]);
+            Bytes v = o.buffer(kComponentIds[i]);
             ASSERT_FALSE(v.empty());
             EXPECT_NE(v[0], 0) << "leading zero in component " << i;
             bns.push_back(BN_bin2bn(v.data(), static_cast<int>(v.size()), nullptr));
             OSSL_PARAM_BLD_push_BN(bld, kComponentNames[i], bns.back());
         }
-        EXPECT_EQ(o.get(TEE_ATTR_RSA_MODULUS).size(), c.bits / 8);
+        EXPECT_EQ(o.buffer(TEE_ATTR_RSA_MODULUS).size(), c.bits / 8);
         OSSL_PARAM *params = OSSL_PARAM_BLD_to_param(bld);
         Ctx from(EVP_PKEY_CTX_new_from_name(nullptr, "RSA", nullptr));
         EVP_PKEY *raw = nullptr;

@@ -437,29 +437,10 @@ TEST_F(Rsa, BeginRefusesPaddingAndDigestCombinations) {
 // missing, once, and still releases the rest.
 TEST_F(Rsa, DestroyNamesEachMissingMember) {
     Bytes blob = import_pem(kRsa1024Pem);
-    auto count = [] {
-        int n = 0;
-        for (const auto &l : tee_host::trace::captured())
-            n += l.message == "Try to free invalid rsa_sign_operation_t";
-        return n;
-    };
     for (int missing = 1; missing <= 3; ++missing) {
-        uint8_t *key_data = nullptr;
-        uint32_t key_data_len = 0;
-        keymaster_key_param_set_t key_params{};
-        keymaster_key_param_set_t in_params{};
-        keymaster_key_param_set_t out_params{};
-        int32_t error = 0;
-        ASSERT_EQ(
-            open_key(blob.data(), static_cast<uint32_t>(blob.size()), &key_data, &key_data_len, &key_params, &error),
-            TEE_SUCCESS);
-        Bytes ser = op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, KM_DIGEST_SHA_2_256).serialize();
-        ASSERT_EQ(unmarshal(ser.data(), static_cast<uint32_t>(ser.size()), &in_params), TEE_SUCCESS);
-        const purpose_ops_t *ops = find_purpose_ops(KM_ALGORITHM_RSA, KM_PURPOSE_SIGN);
-        ASSERT_NE(ops, nullptr);
-        operation_t *op = ops->create_operation(key_data, key_data_len, &key_params, &in_params, &out_params, &error);
-        ASSERT_NE(op, nullptr) << dump_log();
-        op->key_params = key_params;
+        operation_t *op = create_record(blob, KM_ALGORITHM_RSA, KM_PURPOSE_SIGN,
+                                        op_params(KM_PAD_RSA_PKCS1_1_5_SIGN, KM_DIGEST_SHA_2_256));
+        ASSERT_NE(op, nullptr);
         auto *rec = operation_record<rsa_sign_operation_t>(op);
         // Take away the key object, then the RSA operation, then the message buffer.
         TEE_FreeTransientObject(rec->key);
@@ -474,9 +455,7 @@ TEST_F(Rsa, DestroyNamesEachMissingMember) {
         }
         tee_host::trace::clear();
         operation_destroy(op);
-        EXPECT_EQ(count(), missing) << dump_log();
-        ta_free_wiped(key_data, key_data_len);
-        key_param_set_release(&in_params);
+        EXPECT_EQ(logged_count("Try to free invalid rsa_sign_operation_t"), missing) << dump_log();
     }
     tee_host::trace::clear();
     operation_destroy(nullptr);

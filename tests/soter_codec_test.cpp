@@ -24,17 +24,10 @@ using Codec = TaTest;
 
 // One TLV entry in wire form.
 Bytes tlv(uint16_t type, const Bytes &value) {
-    Bytes out = {static_cast<uint8_t>(type), static_cast<uint8_t>(type >> 8), static_cast<uint8_t>(value.size()),
-                 static_cast<uint8_t>(value.size() >> 8)};
-    out.insert(out.end(), value.begin(), value.end());
-    return out;
-}
-
-Bytes concat(std::initializer_list<Bytes> parts) {
-    Bytes out;
-    for (const Bytes &p : parts)
-        out.insert(out.end(), p.begin(), p.end());
-    return out;
+    const auto len = static_cast<uint16_t>(value.size());
+    return concat({{static_cast<uint8_t>(type), static_cast<uint8_t>(type >> 8), static_cast<uint8_t>(len),
+                    static_cast<uint8_t>(len >> 8)},
+                   value});
 }
 
 Bytes value_of(const tlv_box *box, uint16_t type) {

@@ -17,6 +17,7 @@
 
 #include "cli_files.h"
 #include "rsa_keys.h"
+#include "scratch_dir.h"
 #include "soter/verifier.h"
 #include "soter_keys.h"
 
@@ -470,9 +471,6 @@ namespace fs = std::filesystem;
 class KmctlSoterVerify : public ::testing::Test {
   protected:
     void SetUp() override {
-        char tmpl[] = "/tmp/kmctl-soter-verify-XXXXXX";
-        ASSERT_NE(mkdtemp(tmpl), nullptr);
-        dir_ = tmpl;
         spit(dir_ / "attk.der", spki(attk()));
         spit(dir_ / "attk.pem", bytes_of(pem_one_line(attk()) + "\n"));
         spit(dir_ / "app.export", export_output(export_doc(app_key()), attk()));
@@ -480,11 +478,6 @@ class KmctlSoterVerify : public ::testing::Test {
         spit(dir_ / "sign.out", sign_output(sign_doc(), auth_key()));
         spit(dir_ / "challenge", bytes_of(kChallenge));
     }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     // kmctl with a state directory that must never come to exist.
     CliRun kmctl(const std::string &args) {
         std::string cmd = std::string("cd '") + dir_.string() + "' && '" + KMCTL_PATH + "' --state '" +
@@ -499,7 +492,8 @@ class KmctlSoterVerify : public ::testing::Test {
         return r;
     }
 
-    fs::path dir_;
+    ScratchDir scratch_{"kmctl-soter-verify"};
+    const fs::path &dir_ = scratch_.path();
 };
 
 TEST_F(KmctlSoterVerify, ChainOnTheCommandLineWithPemAndDerKeys) {

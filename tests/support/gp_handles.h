@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <random>
+#include <utility>
 #include <vector>
 
 #include "ta_fixture.h"
@@ -39,11 +40,17 @@ inline TEE_Attribute value_attr(uint32_t id, uint32_t a, uint32_t b = 0) {
     return attr;
 }
 
-// A transient object of a type and maximum size.
+// Buffer attributes by id, each holding its bytes.
+using Attrs = std::vector<std::pair<uint32_t, Bytes>>;
+
+// A transient object of a type and maximum size, populated when attributes are given.
 struct Obj {
     TEE_ObjectHandle h = TEE_HANDLE_NULL;
     Obj(uint32_t type, uint32_t max_bits) {
         EXPECT_EQ(TEE_AllocateTransientObject(type, max_bits, &h), TEE_SUCCESS) << std::hex << type;
+    }
+    Obj(uint32_t type, uint32_t max_bits, const Attrs &attrs) : Obj(type, max_bits) {
+        EXPECT_EQ(populate(attrs), TEE_SUCCESS);
     }
     ~Obj() { TEE_FreeTransientObject(h); }
     Obj(const Obj &) = delete;
@@ -53,9 +60,15 @@ struct Obj {
     TEE_Result populate(const std::vector<TEE_Attribute> &attrs) {
         return TEE_PopulateTransientObject(h, attrs.data(), u32(attrs.size()));
     }
-    // buffer - a buffer attribute read back whole.
+    TEE_Result populate(const Attrs &attrs) {
+        std::vector<TEE_Attribute> refs;
+        for (const auto &[id, bytes] : attrs)
+            refs.push_back(ref_attr(id, bytes));
+        return populate(refs);
+    }
+    // buffer - a buffer attribute (at most 1 KiB) read back whole.
     Bytes buffer(uint32_t id) const {
-        Bytes out(256);
+        Bytes out(1024);
         uint32_t len = u32(out.size());
         EXPECT_EQ(TEE_GetObjectBufferAttribute(h, id, out.data(), &len), TEE_SUCCESS) << std::hex << id;
         out.resize(len);

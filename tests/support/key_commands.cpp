@@ -8,8 +8,11 @@
 
 #include <openssl/evp.h>
 
+#include "key_store.h"
 #include "keymaster_defs.h"
 #include "km/key_material.h"
+#include "marshal.h"
+#include "ta_heap.h"
 #include "ta_entry.h"
 
 const EVP_MD *md_for(uint32_t digest) {
@@ -85,20 +88,11 @@ Outcome KeyTest::character_size(const Bytes &reference, uint32_t *size) {
     return outcome(res, p);
 }
 
-Outcome KeyTest::characteristics(const Bytes &reference, Bytes *out, size_t capacity) {
+Outcome KeyTest::reference_command(uint32_t cmd, const Bytes &reference, Bytes *out, size_t capacity) {
     Bytes in = reference;
     out->assign(capacity, 0xEE);
     Params p = Params::io(0, 0, &in, out);
-    TEE_Result res = invoke(KM_CMD_GET_KEY_CHARACTER, p);
-    out->resize(p.p[2].memref.size);
-    return outcome(res, p);
-}
-
-Outcome KeyTest::export_key(const Bytes &reference, Bytes *out, size_t capacity) {
-    Bytes in = reference;
-    out->assign(capacity, 0xEE);
-    Params p = Params::io(0, 0, &in, out);
-    TEE_Result res = invoke(KM_CMD_EXPORT_KEY, p);
+    TEE_Result res = invoke(cmd, p);
     out->resize(p.p[2].memref.size);
     return outcome(res, p);
 }
@@ -209,6 +203,36 @@ Bytes KeyTest::mint_token(uint64_t challenge, uint64_t user_id, uint64_t authent
         mint_auth_token(tee_->boot_seed(), {challenge, user_id, authenticator_id, auth_type, timestamp_ms, version});
     EXPECT_EQ(t.size(), 69u);
     return t;
+}
+
+operation_t *KeyTest::create_record(const Bytes &blob, uint32_t algorithm, uint32_t purpose,
+                                    const km::ParamSet &params) {
+    uint8_t *key_data = nullptr;
+    uint32_t key_data_len = 0;
+    keymaster_key_param_set_t key_params{};
+    keymaster_key_param_set_t in_params{};
+    keymaster_key_param_set_t out_params{};
+    int32_t error = 0;
+    if (open_key(blob.data(), static_cast<uint32_t>(blob.size()), &key_data, &key_data_len, &key_params, &error) !=
+        TEE_SUCCESS) {
+        ADD_FAILURE() << "the blob does not open, error " << error;
+        return nullptr;
+    }
+    const Bytes ser = params.serialize();
+    const purpose_ops_t *ops = find_purpose_ops(algorithm, purpose);
+    operation_t *op = nullptr;
+    if (ops && unmarshal(ser.data(), static_cast<uint32_t>(ser.size()), &in_params) == TEE_SUCCESS)
+        op = ops->create_operation(key_data, key_data_len, &key_params, &in_params, &out_params, &error);
+    if (op)
+        op->key_params = key_params;
+    else
+        key_param_set_release(&key_params);
+    EXPECT_NE(op, nullptr) << "create refused, error " << error << "\n" << dump_log();
+    // Like begin, the record outlives the key data and the begin parameters.
+    ta_free_wiped(key_data, key_data_len);
+    key_param_set_release(&in_params);
+    key_param_set_release(&out_params);
+    return op;
 }
 
 km::ParamSet KeyTest::hmac_params(uint32_t key_bits, uint32_t digest, uint32_t min_mac) {

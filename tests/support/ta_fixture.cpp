@@ -9,9 +9,6 @@
 #include "ta_entry.h"
 
 void TeeTest::SetUp() {
-    char tmpl[] = "/tmp/tee-test-XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
     restart();
 }
 
@@ -27,14 +24,10 @@ void TeeTest::TearDown() {
     EXPECT_EQ(tee_host::handles::live_operations(), 0u);
     EXPECT_EQ(tee_host::handles::live_objects(), 0u);
     tee_.reset();
-    std::error_code ec;
-    std::filesystem::remove_all(dir_, ec);
 }
 
 void TaTest::SetUp() {
-    char tmpl[] = "/tmp/km-test-XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    state_dir_ = tmpl;
+    state_dir_ = scratch_.emplace("km-test").path();
     tee_host::Config config;
     config.state_dir = state_dir_;
     start(config);
@@ -68,8 +61,6 @@ void TaTest::TearDown() {
     EXPECT_EQ(tee_host::handles::leaked_at_last_destroy(), 0u) << "TEE handles left to the instance teardown";
     for (const auto &a : tee_host::heap::leaks_at_last_destroy())
         ADD_FAILURE() << "leaked " << a.size << " bytes allocated at " << a.file << ":" << a.line;
-    std::error_code ec;
-    std::filesystem::remove_all(state_dir_, ec);
 }
 
 uint32_t TaTest::open(const TEE_UUID *ta_client) {
@@ -96,6 +87,13 @@ bool TaTest::logged_message(std::string_view message) const {
         if (l.message == message)
             return true;
     return false;
+}
+
+int TaTest::logged_count(std::string_view message) const {
+    int n = 0;
+    for (const auto &l : tee_host::trace::captured())
+        n += l.message == message;
+    return n;
 }
 
 std::string TaTest::dump_log() const {
@@ -129,6 +127,13 @@ int sweep_allocations(const std::string &what, const std::function<void()> &setu
             return n;
         }
     }
+}
+
+Bytes concat(std::initializer_list<Bytes> parts) {
+    Bytes out;
+    for (const Bytes &p : parts)
+        out.insert(out.end(), p.begin(), p.end());
+    return out;
 }
 
 Bytes hex(std::string_view s) {

@@ -8,7 +8,9 @@
 
 #include <cstdint>
 #include <functional>
+#include <initializer_list>
 #include <memory>
+#include <optional>
 #include <ostream>
 #include <string>
 #include <string_view>
@@ -16,6 +18,7 @@
 
 #include <gtest/gtest.h>
 
+#include "scratch_dir.h"
 #include "ta_calls.h"
 #include "tee_host.h"
 
@@ -27,7 +30,9 @@ class TeeTest : public ::testing::Test {
     void TearDown() override;
     // restart - a new Tee on the same state directory.
     void restart();
-    std::filesystem::path dir_;
+    // Declared first, so that the directory goes after the Tee using it.
+    ScratchDir scratch_{"tee-test"};
+    const std::filesystem::path &dir_ = scratch_.path();
     std::unique_ptr<tee_host::Tee> tee_;
 };
 
@@ -48,15 +53,19 @@ class TaTest : public ::testing::Test {
     // logged - whether a captured line has this level, function and message.
     bool logged(int level, std::string_view func, std::string_view message) const;
     bool logged_message(std::string_view message) const;
+    // logged_count - how many captured lines carry this message.
+    int logged_count(std::string_view message) const;
     std::string dump_log() const;
 
     // extra_allocations - live TA heap blocks beyond what the TA instance
     // itself holds between commands (its use log and token cache).
     size_t extra_allocations() const { return tee_host::heap::stats().live_count - baseline_live_; }
 
+    // Made by SetUp: a TaTest driven without it (in a child) leaves no directory behind.
+    std::optional<ScratchDir> scratch_;
+    std::filesystem::path state_dir_;
     std::unique_ptr<tee_host::Tee> tee_;
     size_t baseline_live_ = 0;
-    std::filesystem::path state_dir_;
     uint32_t session_ = 0;
 };
 
@@ -71,5 +80,8 @@ int sweep_allocations(const std::string &what, const std::function<void()> &setu
                       const std::vector<Outcome> &allowed, const std::function<void()> &cleanup = nullptr);
 
 Bytes hex(std::string_view s);
+
+// concat - the parts one after another.
+Bytes concat(std::initializer_list<Bytes> parts);
 
 #endif
