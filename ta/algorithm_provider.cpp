@@ -156,12 +156,13 @@ bool refused_size(const key_size_rule_t &rule, uint32_t bits, int32_t *error, co
 
 } // namespace
 
-uint32_t provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, int32_t *error,
-                                  const char *func) {
+bool provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, uint32_t *bits,
+                              int32_t *error, const char *func) {
     const key_param_t *size = provider_param(params, KM_TAG_KEY_SIZE, "KM_TAG_KEY_SIZE or specified", error, func);
     if (!size || refused_size(rule, size->integer, error, func))
-        return 0;
-    return size->integer;
+        return false;
+    *bits = size->integer;
+    return true;
 }
 
 namespace {
@@ -268,8 +269,8 @@ TEE_Result provider_generate_secret(const secret_key_family_t &family, keymaster
     return provider_key_slot(
         params, KM_ORIGIN_GENERATED, key_data, key_data_len, error,
         [&](heap_buf *buf, TEE_Result *res) {
-            const uint32_t bits = provider_generation_size(params, family.sizes, error, func);
-            if (!bits)
+            uint32_t bits = 0;
+            if (!provider_generation_size(params, family.sizes, &bits, error, func))
                 return false;
             uint32_t words[2] = {bits, family.tee_type};
             *res = family.vet(params, bits, true, &words[1], error, func);

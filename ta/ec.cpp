@@ -64,8 +64,8 @@ TEE_Result ec_generate_key(keymaster_key_param_set_t *params, uint8_t **key_data
                            int32_t *error) {
     return provider_key_slot(
         params, KM_ORIGIN_GENERATED, key_data, key_data_len, error, [&](heap_buf *buf, TEE_Result *res) {
-            const uint32_t key_size = provider_generation_size(params, kSizes, error, "ec_generate_key");
-            if (!key_size)
+            uint32_t key_size = 0;
+            if (!provider_generation_size(params, kSizes, &key_size, error, "ec_generate_key"))
                 return false;
             TEE_Attribute curve{};
             TEE_InitValueAttribute(&curve, TEE_ATTR_ECC_CURVE, curve_of(key_size)->curve, 0);

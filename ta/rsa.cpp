@@ -78,9 +78,8 @@ bool generation_params(const keymaster_key_param_set_t *params, uint64_t *expone
                                           error, "rsa_generate_key");
     if (!e)
         return false;
-    *key_size = provider_generation_size(params, kSizes, error, "rsa_generate_key");
     *exponent = e->long_integer;
-    return *key_size != 0;
+    return provider_generation_size(params, kSizes, key_size, error, "rsa_generate_key");
 }
 
 // Import's exponent rule: e must fit the tag's 64 bits, whether the tag is

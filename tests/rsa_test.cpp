@@ -220,6 +220,14 @@ TEST_F(Rsa, GenerationRules) {
         EXPECT_EQ(generate(bad, &blob).error, KM_ERROR_UNSUPPORTED_KEY_SIZE);
         EXPECT_TRUE(logged_message("Invalid RSA key size " + std::to_string(bits)));
     }
+    // 0 bits passes the size rule (whole bytes, not above the maximum); the
+    // TEE refuses it, and its answer comes back, not an unknown error.
+    ParamSet zero = key_params();
+    zero.add(KM_TAG_KEY_SIZE, 0).add(KM_TAG_RSA_PUBLIC_EXPONENT, 65537);
+    const Outcome refused = generate(zero, &blob);
+    EXPECT_EQ(refused.res, TEE_ERROR_NOT_SUPPORTED) << dump_log();
+    EXPECT_EQ(refused.error, KM_ERROR_OK);
+    EXPECT_TRUE(blob.empty());
     ParamSet no_e = key_params();
     no_e.add(KM_TAG_KEY_SIZE, 1024);
     tee_host::trace::clear();

@@ -328,12 +328,12 @@ struct key_size_rule_t {
 
 /*
  * provider_generation_size - the key size of a generation: the single
- * KM_TAG_KEY_SIZE, when the rule takes it. Its bits, or 0 with the refusal
- * logged in func's name: "No or too many KM_TAG_KEY_SIZE or specified"
- * (*error -38) or "Invalid <label> key size %d" (*error -6).
+ * KM_TAG_KEY_SIZE, when the rule takes it. True with *bits; false with the
+ * refusal logged in func's name: "No or too many KM_TAG_KEY_SIZE or
+ * specified" (*error -38) or "Invalid <label> key size %d" (*error -6).
  */
-uint32_t provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, int32_t *error,
-                                  const char *func);
+bool provider_generation_size(const keymaster_key_param_set_t *params, const key_size_rule_t &rule, uint32_t *bits,
+                              int32_t *error, const char *func);
 
 /*
  * provider_generated_pair - the key data of a fresh key pair of TEE type
