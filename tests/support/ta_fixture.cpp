@@ -89,10 +89,10 @@ bool TaTest::logged_message(std::string_view message) const {
     return false;
 }
 
-int TaTest::logged_count(std::string_view message) const {
+int TaTest::logged_count(std::string_view message, bool prefix) const {
     int n = 0;
     for (const auto &l : tee_host::trace::captured())
-        n += l.message == message;
+        n += prefix ? std::string_view(l.message).substr(0, message.size()) == message : l.message == message;
     return n;
 }
 

@@ -53,8 +53,8 @@ class TaTest : public ::testing::Test {
     // logged - whether a captured line has this level, function and message.
     bool logged(int level, std::string_view func, std::string_view message) const;
     bool logged_message(std::string_view message) const;
-    // logged_count - how many captured lines carry this message.
-    int logged_count(std::string_view message) const;
+    // logged_count - how many captured lines carry this message (or, with prefix, start with it).
+    int logged_count(std::string_view message, bool prefix = false) const;
     std::string dump_log() const;
 
     // extra_allocations - live TA heap blocks beyond what the TA instance
